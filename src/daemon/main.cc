@@ -1,0 +1,2 @@
+// Entry point of typhorad (being written).
+int main() { return 0; }

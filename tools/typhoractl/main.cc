@@ -1,0 +1,2 @@
+// Entry point of typhoractl (being written).
+int main() { return 0; }
