@@ -25,10 +25,14 @@ using IpcErrorHandler = std::function<void(const std::string& error)>;
 // The object whose operations a connection serves. invoke() runs on the connection's serial
 // queue, with the connection current, and only for operations of the exported interface whose
 // arguments matched. `reply` is empty for a one-way operation.
+//
+// invoke() answers false when the object does not implement the operation: the IPC layer then
+// refuses the call as an unrecognised operation (logged with "lumo error: %s - %@", and an error
+// reply to the caller when the call expected one), exactly as for an unknown operation.
 class IpcExportedObject {
  public:
   virtual ~IpcExportedObject() = default;
-  virtual void invoke(const IpcOperation& operation, const std::vector<Value>& arguments,
+  virtual bool invoke(const IpcOperation& operation, const std::vector<Value>& arguments,
                       IpcReply reply) = 0;
 };
 
