@@ -1,1 +1,89 @@
-// Being written.
+#include "daemon/typhora_daemon.h"
+
+#include <cmath>
+#include <cstdlib>
+
+#include "platform/log.h"
+
+namespace typhora {
+namespace {
+
+constexpr const char* kVersionKey = "version";
+constexpr std::int64_t kCurrentVersion = 1;
+
+Platform* installedPlatform = nullptr;
+
+// The stored version as an integer: a missing or non-numeric value reads as 0.
+std::int64_t storedVersion(const Value& v) {
+  if (auto i = v.asInt()) return *i;
+  if (auto d = v.asDouble(); d && std::isfinite(*d)) return static_cast<std::int64_t>(*d);
+  if (v.asUInt()) return INT64_MAX;
+  return 0;
+}
+
+}  // namespace
+
+TyphoraDaemon::TyphoraDaemon(Platform& platform)
+    : platform_(platform),
+      mainHandlerQueue_(SerialQueue::create(kMainHandlerQueueLabel, &platform.clock)) {}
+
+TyphoraDaemon::~TyphoraDaemon() = default;
+
+void TyphoraDaemon::installPlatform(Platform& platform) { installedPlatform = &platform; }
+
+TyphoraDaemon& TyphoraDaemon::sharedDaemon() {
+  // A function-local static is made once, safely against concurrent first calls. The daemon is
+  // never destroyed while the process runs.
+  static const std::shared_ptr<TyphoraDaemon> daemon = [] {
+    if (installedPlatform == nullptr) {
+      std::fputs("typhorad: sharedDaemon() called before a platform was installed\n", stderr);
+      std::abort();
+    }
+    return std::make_shared<TyphoraDaemon>(*installedPlatform);
+  }();
+  return *daemon;
+}
+
+void TyphoraDaemon::startUp() {
+  setupForLumoService();
+  setupForScheduledFontDeletion();
+  setupForDistributedNotifications();
+  setupForBlacklistUpdatedNotification();
+  setupForMonitoringFontAssets();
+  setup();
+}
+
+void TyphoraDaemon::setupForLumoService() {
+  listener_ = platform_.ipc.makeNamedListener(kServiceName);
+  listener_->setDelegate(weak_from_this());
+  listener_->resume();
+  // From here on connections are admitted on IPC threads while start-up goes on.
+  (void)isUserFontInstalled();  // preloads the user-fonts information before the first check-in
+}
+
+// Start-up steps whose subsystems arm nothing yet.
+void TyphoraDaemon::setupForScheduledFontDeletion() {}
+void TyphoraDaemon::setupForDistributedNotifications() {}
+void TyphoraDaemon::setupForBlacklistUpdatedNotification() {}
+void TyphoraDaemon::setupForMonitoringFontAssets() {}
+
+void TyphoraDaemon::setup() {
+  if (storedVersion(platform_.preferences.value(kVersionKey)) > 0) return;
+  platform_.fontManager.reset();
+  platform_.preferences.setValue(kVersionKey, Value(kCurrentVersion));
+  platform_.preferences.synchronize();
+}
+
+void TyphoraDaemon::run() { platform_.mainQueue.run(); }
+
+Value TyphoraDaemon::blacklistInfo() const {
+  std::lock_guard lock(blacklistInfoMutex_);
+  return blacklistInfo_;
+}
+
+void TyphoraDaemon::setBlacklistInfo(Value list) {
+  std::lock_guard lock(blacklistInfoMutex_);
+  blacklistInfo_ = std::move(list);
+}
+
+}  // namespace typhora

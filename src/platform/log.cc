@@ -1,1 +1,168 @@
-// Being written.
+#include "platform/log.h"
+
+#include <syslog.h>
+#include <systemd/sd-journal.h>
+
+#include <atomic>
+#include <chrono>
+#include <cstdio>
+#include <ctime>
+#include <mutex>
+
+namespace typhora {
+namespace {
+
+std::atomic<LogLevel> minimumLevel{LogLevel::Info};
+
+std::mutex& sinkMutex() {
+  static auto* m = new std::mutex();
+  return *m;
+}
+std::shared_ptr<LogSink>& currentSink() {
+  static auto* sink = new std::shared_ptr<LogSink>();
+  return *sink;
+}
+
+const char* levelName(LogLevel level) {
+  switch (level) {
+    case LogLevel::Debug: return "debug";
+    case LogLevel::Info: return "info";
+    case LogLevel::Error: return "error";
+  }
+  return "info";
+}
+
+std::string timestamp() {
+  auto now = std::chrono::system_clock::now();
+  std::time_t seconds = std::chrono::system_clock::to_time_t(now);
+  auto millis = std::chrono::duration_cast<std::chrono::milliseconds>(now.time_since_epoch()) % 1000;
+  std::tm tm{};
+  gmtime_r(&seconds, &tm);
+  char buffer[40];
+  std::size_t n = std::strftime(buffer, sizeof buffer, "%Y-%m-%dT%H:%M:%S", &tm);
+  std::snprintf(buffer + n, sizeof buffer - n, ".%03dZ", static_cast<int>(millis.count()));
+  return buffer;
+}
+
+class StderrSink final : public LogSink {
+ public:
+  void write(LogLevel level, const LogCategory* category, std::string_view message) override {
+    std::string line = timestamp() + " " + levelName(level) + " ";
+    if (category != nullptr) {
+      line += std::string(category->subsystem) + ":" + category->category;
+    } else {
+      line += "system";
+    }
+    line += " ";
+    line += message;
+    line += "\n";
+    std::fwrite(line.data(), 1, line.size(), stderr);
+    std::fflush(stderr);
+  }
+};
+
+class JournalSink final : public LogSink {
+ public:
+  void write(LogLevel level, const LogCategory* category, std::string_view message) override {
+    int priority = level == LogLevel::Error ? LOG_ERR : level == LogLevel::Debug ? LOG_DEBUG : LOG_INFO;
+    std::string text(message);
+    sd_journal_send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", priority,
+                    "SYSLOG_IDENTIFIER=typhorad", "TYPHORA_CATEGORY=%s",
+                    category != nullptr ? category->category : "system", nullptr);
+  }
+};
+
+// Appends the conversion at `spec` (one letter, after any length modifiers) for `arg`.
+void appendConversion(std::string* out, char spec, const LogArg& arg) {
+  const auto& v = arg.value();
+  if (spec == '@' || spec == 's') {
+    if (auto* s = std::get_if<std::string>(&v)) {
+      *out += *s;
+    } else if (auto* i = std::get_if<std::int64_t>(&v)) {
+      *out += std::to_string(*i);
+    } else if (auto* u = std::get_if<std::uint64_t>(&v)) {
+      *out += std::to_string(*u);
+    } else {
+      *out += std::to_string(std::get<double>(v));
+    }
+    return;
+  }
+  if (auto* i = std::get_if<std::int64_t>(&v)) {
+    *out += std::to_string(*i);
+  } else if (auto* u = std::get_if<std::uint64_t>(&v)) {
+    *out += std::to_string(*u);
+  } else if (auto* d = std::get_if<double>(&v)) {
+    *out += spec == 'f' ? std::to_string(*d) : std::to_string(static_cast<std::int64_t>(*d));
+  } else {
+    *out += std::get<std::string>(v);
+  }
+}
+
+}  // namespace
+
+std::string formatLog(std::string_view format, std::initializer_list<LogArg> args) {
+  std::string out;
+  out.reserve(format.size() + 32);
+  auto next = args.begin();
+  for (std::size_t i = 0; i < format.size(); ++i) {
+    char c = format[i];
+    if (c != '%' || i + 1 >= format.size()) {
+      out += c;
+      continue;
+    }
+    std::size_t j = i + 1;
+    if (format[j] == '%') {
+      out += '%';
+      i = j;
+      continue;
+    }
+    while (j < format.size() && (format[j] == 'l' || format[j] == 'z' || format[j] == 'h')) ++j;
+    if (j >= format.size()) {
+      out += format.substr(i);
+      break;
+    }
+    char spec = format[j];
+    if (spec != '@' && spec != 's' && spec != 'd' && spec != 'i' && spec != 'u' && spec != 'f') {
+      out += format.substr(i, j - i + 1);  // unknown conversions stay as written
+      i = j;
+      continue;
+    }
+    if (next == args.end()) {
+      out += "(missing)";
+    } else {
+      appendConversion(&out, spec, *next++);
+    }
+    i = j;
+  }
+  return out;
+}
+
+std::shared_ptr<LogSink> setLogSink(std::shared_ptr<LogSink> sink) {
+  std::lock_guard lock(sinkMutex());
+  return std::exchange(currentSink(), std::move(sink));
+}
+
+void setLogLevel(LogLevel level) { minimumLevel = level; }
+LogLevel logLevel() { return minimumLevel; }
+
+std::shared_ptr<LogSink> makeStderrLogSink() { return std::make_shared<StderrSink>(); }
+std::shared_ptr<LogSink> makeJournalLogSink() { return std::make_shared<JournalSink>(); }
+
+void logWrite(LogLevel level, const LogCategory* category, std::string_view format,
+              std::initializer_list<LogArg> args) {
+  if (level < minimumLevel.load()) return;
+  std::string message = formatLog(format, args);
+  std::shared_ptr<LogSink> sink;
+  {
+    std::lock_guard lock(sinkMutex());
+    sink = currentSink();
+  }
+  if (!sink) {
+    static auto* fallback = new StderrSink();
+    fallback->write(level, category, message);
+    return;
+  }
+  sink->write(level, category, message);
+}
+
+}  // namespace typhora

@@ -1,1 +1,26 @@
-// Being written.
+#include "platform/semaphore.h"
+
+namespace typhora {
+
+void Semaphore::signal() {
+  {
+    std::lock_guard lock(mutex_);
+    ++count_;
+  }
+  cv_.notify_one();
+}
+
+void Semaphore::wait() {
+  std::unique_lock lock(mutex_);
+  cv_.wait(lock, [this] { return count_ > 0; });
+  --count_;
+}
+
+bool Semaphore::waitFor(std::chrono::nanoseconds timeout) {
+  std::unique_lock lock(mutex_);
+  if (!cv_.wait_for(lock, timeout, [this] { return count_ > 0; })) return false;
+  --count_;
+  return true;
+}
+
+}  // namespace typhora

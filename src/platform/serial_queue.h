@@ -56,8 +56,10 @@ class SerialQueue : public std::enable_shared_from_this<SerialQueue> {
   static void setPoolLimit(std::size_t limit);
   static std::size_t poolThreadCount();  // workers alive now
 
- protected:
+  // The queue's shared state (opaque; jobs in flight keep it alive).
   struct State;
+
+ protected:
   explicit SerialQueue(std::shared_ptr<State> state);
 
  private:

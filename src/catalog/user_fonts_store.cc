@@ -1,0 +1,67 @@
+// The cached user-fonts information: loaded from the user-fonts file on first read, dropped when
+// fonts change, and read again by the first reader after that.
+#include <string>
+
+#include "daemon/typhora_daemon.h"
+#include "platform/log.h"
+
+namespace typhora {
+namespace {
+
+constexpr const char* kMobileHomeFormat = "/var/mobile/%@";
+constexpr const char* kUserFontsFile = "Library/UserFonts/UserFonts.plist";
+constexpr const char* kErrorReading = "error reading %@";
+
+}  // namespace
+
+const Value& TyphoraDaemon::loadedUserFontsInfoLocked() {
+  if (userFontsInfo_.isNull()) {
+    userFontsInfo_ = _userFontsInfoFromDisk();
+    if (userFontsInfo_.isNull()) userFontsInfo_ = Value(Dictionary());
+  }
+  return userFontsInfo_;
+}
+
+bool TyphoraDaemon::isUserFontInstalled() {
+  std::lock_guard lock(userFontsInfoMutex_);
+  const Dictionary* info = loadedUserFontsInfoLocked().asDictionary();
+  return info != nullptr && !info->empty();
+}
+
+Value TyphoraDaemon::userFontsInfo() {
+  std::lock_guard lock(userFontsInfoMutex_);
+  const Value& info = loadedUserFontsInfoLocked();
+  const Dictionary* entries = info.asDictionary();
+  // An empty information is never handed out: readers see absent instead.
+  return entries != nullptr && !entries->empty() ? info : Value();
+}
+
+void TyphoraDaemon::setUserFontsInfo(Value info) {
+  std::lock_guard lock(userFontsInfoMutex_);
+  userFontsInfo_ = std::move(info);
+}
+
+void TyphoraDaemon::invalidateUserFonts() {
+  std::lock_guard lock(userFontsInfoMutex_);
+  userFontsInfo_ = Value();
+}
+
+Value TyphoraDaemon::_userFontsInfoFromDisk() {
+  Value slot;
+  updatingUserFonts([this, &slot] {
+    const std::string path = formatLog(kMobileHomeFormat, {kUserFontsFile});
+    if (!platform_.fileSystem.fileExists(path)) return;
+    std::string error;
+    std::optional<Value> read = platform_.fileSystem.readPropertyList(path, &error);
+    // A root that is not a dictionary is as unreadable as a file that does not parse: the rest of
+    // the daemon reads the information as a dictionary of records.
+    if (read && read->asDictionary() != nullptr) {
+      slot = std::move(*read);
+    } else {
+      TYLog_Error(kTYLogTyphoraDaemon, kErrorReading, path);
+    }
+  });
+  return slot;
+}
+
+}  // namespace typhora

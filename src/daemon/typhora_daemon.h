@@ -1,0 +1,114 @@
+// The one daemon object. It owns every piece of shared state, the queues that guard it, and the
+// start-up order; each subsystem's operations are defined in that subsystem's folder.
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <vector>
+
+#include "platform/ipc_listener.h"
+#include "platform/platform.h"
+#include "platform/serial_queue.h"
+#include "platform/value.h"
+
+namespace typhora {
+
+class TyphoraHandler;
+
+inline constexpr const char* kServiceName = "com.zorvane.typhorad";
+inline constexpr const char* kMainHandlerQueueLabel = "com.zorvane.typhorad";
+inline constexpr const char* kUpdatingUserFontsQueueLabel = "com.zorvane.typhora.UpdatingUserFonts";
+
+class TyphoraDaemon final : public IpcListenerDelegate,
+                            public std::enable_shared_from_this<TyphoraDaemon> {
+ public:
+  // `init`: creates mainHandlerQueue and nothing else. Tests make as many daemons as they like.
+  explicit TyphoraDaemon(Platform& platform);
+  ~TyphoraDaemon() override;
+  TyphoraDaemon(const TyphoraDaemon&) = delete;
+  TyphoraDaemon& operator=(const TyphoraDaemon&) = delete;
+
+  // --- Daemon core: the process-wide daemon, start-up and the run loop (daemon/) ---
+
+  // The platform sharedDaemon() builds its daemon on; main installs it before the first call.
+  static void installPlatform(Platform& platform);
+  // The one daemon of the process, made by the first call (safe against concurrent first calls).
+  static TyphoraDaemon& sharedDaemon();
+
+  // Start-up steps 2 to 7, in their fixed order, on the main thread.
+  void startUp();
+  void setupForLumoService();
+  void setupForScheduledFontDeletion();
+  void setupForDistributedNotifications();
+  void setupForBlacklistUpdatedNotification();
+  void setupForMonitoringFontAssets();
+  // The preferences migration.
+  void setup();
+  // Hands the main thread to the main queue for good.
+  [[noreturn]] void run();
+
+  SerialQueue& mainHandlerQueue() const { return *mainHandlerQueue_; }
+  Platform& platform() const { return platform_; }
+
+  // --- Font paths and the update queue (daemon/paths.cc) ---
+
+  // Runs `reply` as one job on the update queue and returns once it has run. Never call it from
+  // a job that already runs on the update queue.
+  void updatingUserFonts(const std::function<void()>& reply);
+
+  // --- Client connections (ipc/) ---
+
+  bool shouldAcceptNewConnection(IpcListener& listener,
+                                 std::shared_ptr<IpcConnection> connection) override;
+  // Carries out an operation that a connection's handler does not serve itself, on the calling
+  // thread, with the caller's connection still current. False when the daemon does not implement
+  // the operation: the call is then refused as unrecognised.
+  bool forwardInvocation(const IpcOperation& operation, const std::vector<Value>& arguments,
+                         const IpcReply& reply);
+
+  // --- Font catalog: the user-fonts information (catalog/user_fonts_store.cc) ---
+
+  // Loads the cache when it is absent; true when it holds at least one entry.
+  bool isUserFontInstalled();
+  // The cached user-fonts information (shared, never copied), or null when there is none.
+  Value userFontsInfo();
+  void setUserFontsInfo(Value info);
+  // Drops the cache; the next reader loads the file again.
+  void invalidateUserFonts();
+  // Reads the user-fonts file on the update queue: the dictionary, or null.
+  Value _userFontsInfoFromDisk();
+
+  // --- Access control (access/) ---
+
+  // The font-access block list. The only field read and written without mainHandlerQueue.
+  Value blacklistInfo() const;
+  void setBlacklistInfo(Value list);
+
+ private:
+  SerialQueue& updateQueue();
+  // The cache, loaded from disk when absent. Called with userFontsInfoMutex_ held.
+  const Value& loadedUserFontsInfoLocked();
+
+  Platform& platform_;
+
+  // Fields, in the order of the daemon's data model.
+  mutable std::mutex blacklistInfoMutex_;
+  Value blacklistInfo_;
+  std::shared_ptr<SerialQueue> mainHandlerQueue_;
+  // The cache is read on mainHandlerQueue, on IPC threads and at start-up on the main thread.
+  // A mutex held across the load makes concurrent first readers wait for one read of the file
+  // instead of each reading it; no other lock is ever taken while holding it, and the update
+  // queue's jobs never take it, so it cannot deadlock.
+  std::mutex userFontsInfoMutex_;
+  Value userFontsInfo_;
+
+  // Only keeps the service listener open for the life of the process; nothing reads it.
+  std::shared_ptr<IpcListener> listener_;
+
+  std::once_flag updateQueueOnce_;
+  std::shared_ptr<SerialQueue> updateQueue_;
+};
+
+}  // namespace typhora

@@ -1,0 +1,35 @@
+// Admission of client connections and the dispatch of operations the handler hands on.
+#include <memory>
+
+#include "daemon/typhora_daemon.h"
+#include "ipc/interface_descriptions.h"
+#include "ipc/typhora_handler.h"
+
+namespace typhora {
+
+bool TyphoraDaemon::shouldAcceptNewConnection(IpcListener& /*listener*/,
+                                              std::shared_ptr<IpcConnection> connection) {
+  // Every connection is accepted: what a client may do is decided per operation.
+  connection->setExportedInterface(typhoraDaemonProtocol());
+  auto handler = std::make_shared<TyphoraHandler>(shared_from_this());
+  connection->setExportedObject(handler);
+  connection->setRemoteInterface(typhoraClientProtocol());
+  // The closure owns the handler; clearing clientConnection breaks the connection-handler cycle.
+  connection->setInvalidationHandler([handler] { handler->setClientConnection(nullptr); });
+  handler->setClientConnection(connection);
+  connection->resume();
+  return true;
+}
+
+bool TyphoraDaemon::forwardInvocation(const IpcOperation& operation,
+                                      const std::vector<Value>& /*arguments*/,
+                                      const IpcReply& reply) {
+  const std::string& name = operation.wireName;
+  if (name == op::kUpdatingUserFonts) {
+    updatingUserFonts([&reply] { reply({}); });
+    return true;
+  }
+  return false;
+}
+
+}  // namespace typhora

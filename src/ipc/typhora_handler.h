@@ -1,0 +1,55 @@
+// One handler per admitted client connection: it serves the check-in operations itself and hands
+// every other operation to the daemon.
+#pragma once
+
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/ipc_connection.h"
+
+namespace typhora {
+
+class TyphoraDaemon;
+
+class TyphoraHandler final : public IpcExportedObject,
+                             public std::enable_shared_from_this<TyphoraHandler> {
+ public:
+  explicit TyphoraHandler(std::shared_ptr<TyphoraDaemon> server);
+  ~TyphoraHandler() override;
+
+  // Runs on the connection's queue with the connection current.
+  bool invoke(const IpcOperation& operation, const std::vector<Value>& arguments,
+              IpcReply reply) override;
+
+  // True exactly for the font-registry library's own process identifier (case-sensitive).
+  static bool isProcessIdentifierToIgnore(const std::string* identifier);
+
+  bool hasEnumerationEntitlement() const;
+  bool hasFontAccessEntitlement() const;
+  bool isFontProvider() const;
+  std::optional<std::string> processIdentifier() const;
+
+  // The connection this handler serves; null once it has been invalidated.
+  std::shared_ptr<IpcConnection> clientConnection() const;
+  void setClientConnection(std::shared_ptr<IpcConnection> connection);
+  const std::shared_ptr<TyphoraDaemon>& server() const { return server_; }
+
+  std::vector<std::shared_ptr<IpcConnection>> webcontentProcessConnections() const;
+
+ private:
+  // The fields are written on the connection's thread and read from mainHandlerQueue and from
+  // invalidation handlers on other threads, so one mutex guards them all.
+  mutable std::mutex mutex_;
+  bool hasEnumerationEntitlement_ = false;
+  bool hasFontAccessEntitlement_ = false;
+  bool isFontProvider_ = false;
+  std::shared_ptr<IpcConnection> clientConnection_;
+  const std::shared_ptr<TyphoraDaemon> server_;
+  std::optional<std::string> processIdentifier_;
+  std::optional<std::vector<std::shared_ptr<IpcConnection>>> webcontentProcessConnections_;
+};
+
+}  // namespace typhora

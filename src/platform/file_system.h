@@ -1,0 +1,21 @@
+// The file operations of the daemon. Paths are the daemon's absolute paths as written
+// ("/var/mobile/..."); the platform decides where they live on the machine.
+#pragma once
+
+#include <optional>
+#include <string>
+
+#include "platform/value.h"
+
+namespace typhora {
+
+class FileSystem {
+ public:
+  virtual ~FileSystem() = default;
+  virtual bool fileExists(const std::string& path) const = 0;
+  // One property list (CBOR or JSON) read from the file; nullopt with `error` set on failure.
+  virtual std::optional<Value> readPropertyList(const std::string& path,
+                                                std::string* error) const = 0;
+};
+
+}  // namespace typhora

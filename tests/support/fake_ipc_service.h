@@ -1,0 +1,50 @@
+// Listeners and connections of the fake IPC: the test connects clients through the named
+// listener's delegate, as the real service does when a process connects.
+#pragma once
+
+#include <map>
+#include <memory>
+#include <mutex>
+
+#include "platform/ipc_listener.h"
+#include "platform/semaphore.h"
+#include "support/fake_ipc_connection.h"
+
+namespace typhora::testing {
+
+class FakeIpcListener final : public IpcListener {
+ public:
+  void setDelegate(std::weak_ptr<IpcListenerDelegate> delegate) override;
+  void resume() override;
+  void invalidate() override;
+  std::shared_ptr<const IpcEndpoint> endpoint() const override { return nullptr; }
+
+  bool resumed() const;
+  // A new client connection offered to the delegate; null when refused or not resumed.
+  std::shared_ptr<FakeIpcConnection> connect(AuditToken token = {});
+
+ private:
+  mutable std::mutex mutex_;
+  std::weak_ptr<IpcListenerDelegate> delegate_;
+  bool resumed_ = false;
+};
+
+class FakeIpcService final : public IpcService {
+ public:
+  std::shared_ptr<IpcListener> makeNamedListener(const std::string& serviceName) override;
+  std::shared_ptr<IpcListener> makeAnonymousListener() override;
+  std::shared_ptr<IpcConnection> connect(std::shared_ptr<const IpcEndpoint> endpoint) override;
+  std::shared_ptr<IpcConnection> connectToService(const std::string& serviceName) override;
+
+  // The named listener made for `serviceName`, or null.
+  std::shared_ptr<FakeIpcListener> listener(const std::string& serviceName) const;
+  // Waits until a named listener for `serviceName` has been resumed.
+  std::shared_ptr<FakeIpcListener> waitForListener(const std::string& serviceName);
+
+ private:
+  mutable std::mutex mutex_;
+  std::map<std::string, std::shared_ptr<FakeIpcListener>> listeners_;
+  Semaphore listenerMade_;
+};
+
+}  // namespace typhora::testing
