@@ -1,2 +1,97 @@
-// Entry point of typhorad (being written).
-int main() { return 0; }
+// typhorad: the font access daemon. Builds the Linux platform, starts the daemon in its fixed
+// order and hands the main thread to the main queue for good.
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <string>
+#include <unistd.h>
+
+#include "daemon/typhora_daemon.h"
+#include "platform/linux/linux_platform.h"
+#include "platform/log.h"
+
+namespace {
+
+constexpr const char* kUsage =
+    "usage: typhorad [--root DIR] [--runtime-dir DIR] [--log-level debug|info|error]\n"
+    "                [--log-target stderr|journal]\n"
+    "\n"
+    "  --root DIR         device root under which every path of the daemon lives (default /)\n"
+    "  --runtime-dir DIR  where the service socket is made (default $RUNTIME_DIRECTORY,\n"
+    "                     else /run/typhora); ignored under systemd socket activation\n"
+    "  --log-level L      lowest level logged (default info)\n"
+    "  --log-target T     stderr, or the journal (default: journal when started by systemd)\n";
+
+struct Options {
+  std::string root = "/";
+  std::string runtimeDir;
+  typhora::LogLevel level = typhora::LogLevel::Info;
+  std::string target;
+};
+
+[[noreturn]] void usageError(const std::string& message) {
+  std::fprintf(stderr, "typhorad: %s\n%s", message.c_str(), kUsage);
+  std::exit(2);
+}
+
+bool parseLevel(const std::string& text, typhora::LogLevel* level) {
+  if (text == "debug") *level = typhora::LogLevel::Debug;
+  else if (text == "info") *level = typhora::LogLevel::Info;
+  else if (text == "error") *level = typhora::LogLevel::Error;
+  else return false;
+  return true;
+}
+
+Options parseOptions(int argc, char** argv) {
+  Options options;
+  for (int i = 1; i < argc; ++i) {
+    std::string arg = argv[i];
+    auto next = [&]() -> std::string {
+      if (i + 1 >= argc) usageError(arg + " needs a value");
+      return argv[++i];
+    };
+    if (arg == "--help" || arg == "-h") {
+      std::fputs(kUsage, stdout);
+      std::exit(0);
+    } else if (arg == "--root") {
+      options.root = next();
+    } else if (arg == "--runtime-dir") {
+      options.runtimeDir = next();
+    } else if (arg == "--log-level") {
+      if (!parseLevel(next(), &options.level)) usageError("unknown log level");
+    } else if (arg == "--log-target") {
+      options.target = next();
+      if (options.target != "stderr" && options.target != "journal") {
+        usageError("unknown log target");
+      }
+    } else {
+      usageError("unknown option " + arg);
+    }
+  }
+  if (options.runtimeDir.empty()) {
+    const char* fromSystemd = std::getenv("RUNTIME_DIRECTORY");
+    options.runtimeDir = fromSystemd != nullptr ? fromSystemd : "/run/typhora";
+  }
+  if (options.target.empty()) {
+    options.target = std::getenv("JOURNAL_STREAM") != nullptr ? "journal" : "stderr";
+  }
+  return options;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  const Options options = parseOptions(argc, argv);
+  std::signal(SIGPIPE, SIG_IGN);
+  typhora::setLogLevel(options.level);
+  typhora::setLogSink(options.target == "journal" ? typhora::makeJournalLogSink()
+                                                  : typhora::makeStderrLogSink());
+
+  // The platform lives as long as the process: nothing is freed at shutdown.
+  static typhora::LinuxPlatform platform(options.root, options.runtimeDir);
+  typhora::TyphoraDaemon::installPlatform(platform.bundle());
+  typhora::TyphoraDaemon& daemon = typhora::TyphoraDaemon::sharedDaemon();
+  daemon.startUp();
+  daemon.run();
+}

@@ -1,0 +1,104 @@
+#include "platform/linux/lumo_frame.h"
+
+#include <cstring>
+
+#include "platform/cbor_codec.h"
+
+namespace typhora {
+namespace {
+
+void putU32(std::uint8_t* at, std::uint32_t v) {
+  for (int i = 0; i < 4; ++i) at[i] = static_cast<std::uint8_t>(v >> (8 * i));
+}
+std::uint32_t getU32(const std::uint8_t* at) {
+  std::uint32_t v = 0;
+  for (int i = 3; i >= 0; --i) v = (v << 8) | at[i];
+  return v;
+}
+
+}  // namespace
+
+bool encodeLumoFrame(const LumoMessage& message, std::vector<std::uint8_t>* frame,
+                     std::vector<int>* fds,
+                     const std::function<int(const std::shared_ptr<const IpcEndpoint>&)>& fdOf,
+                     std::string* error, const LumoLimits& limits) {
+  EndpointHooks hooks;
+  hooks.toIndex = [&](const std::shared_ptr<const IpcEndpoint>& ep) -> std::optional<std::uint64_t> {
+    int fd = fdOf ? fdOf(ep) : -1;
+    if (fd < 0 || fds->size() >= limits.maxDescriptors) return std::nullopt;
+    fds->push_back(fd);
+    return fds->size() - 1;
+  };
+  Value payload = Value::array({Value(static_cast<std::int64_t>(message.kind)), Value(message.id),
+                                Value(message.text), Value(ValueArray(message.values))});
+  frame->assign(kLumoHeaderSize, 0);
+  if (!CborCodec::encode(payload, frame, &hooks, error, limits.maxDepth)) return false;
+  const std::size_t length = frame->size() - kLumoHeaderSize;
+  if (length > limits.maxPayload) {
+    if (error != nullptr) *error = "message larger than the size limit";
+    return false;
+  }
+  putU32(frame->data(), kLumoMagic);
+  putU32(frame->data() + 4, static_cast<std::uint32_t>(length));
+  putU32(frame->data() + 8, static_cast<std::uint32_t>(fds->size()));
+  return true;
+}
+
+LumoFrameDecoder::Status LumoFrameDecoder::next(
+    LumoMessage* message, std::string* error,
+    const std::function<std::shared_ptr<const IpcEndpoint>(UniqueFd)>& toEndpoint) {
+  auto malformed = [error](std::string why) {
+    *error = std::move(why);
+    return Status::Malformed;
+  };
+  const std::size_t available = buffer_.size() - consumed_;
+  if (available < kLumoHeaderSize) return Status::NeedMore;
+  const std::uint8_t* header = buffer_.data() + consumed_;
+  if (getU32(header) != kLumoMagic) return malformed("bad frame magic");
+  const std::uint32_t length = getU32(header + 4);
+  const std::uint32_t descriptorCount = getU32(header + 8);
+  if (length > limits_.maxPayload) return malformed("frame larger than the size limit");
+  if (descriptorCount > limits_.maxDescriptors) return malformed("too many descriptors");
+  if (available < kLumoHeaderSize + length) return Status::NeedMore;
+  if (descriptors_.size() < descriptorCount) return malformed("descriptors missing for a frame");
+
+  std::vector<std::shared_ptr<const IpcEndpoint>> endpoints;
+  for (std::uint32_t i = 0; i < descriptorCount; ++i) {
+    endpoints.push_back(toEndpoint ? toEndpoint(std::move(descriptors_[i])) : nullptr);
+  }
+  descriptors_.erase(descriptors_.begin(), descriptors_.begin() + descriptorCount);
+  EndpointHooks hooks;
+  hooks.fromIndex = [&endpoints](std::uint64_t index) -> std::shared_ptr<const IpcEndpoint> {
+    return index < endpoints.size() ? endpoints[index] : nullptr;
+  };
+  DecodeLimits decodeLimits;
+  decodeLimits.maxBytes = limits_.maxPayload;
+  decodeLimits.maxDepth = limits_.maxDepth;
+  std::span<const std::uint8_t> payload(header + kLumoHeaderSize, length);
+  std::string why;
+  std::optional<Value> decoded = CborCodec::decode(payload, decodeLimits, &hooks, &why);
+  consumed_ += kLumoHeaderSize + length;
+  if (consumed_ > (1u << 20) && consumed_ * 2 > buffer_.size()) {
+    buffer_.erase(buffer_.begin(), buffer_.begin() + static_cast<std::ptrdiff_t>(consumed_));
+    consumed_ = 0;
+  } else if (consumed_ == buffer_.size()) {
+    buffer_.clear();
+    consumed_ = 0;
+  }
+  if (!decoded) return malformed("undecodable message: " + why);
+  const ValueArray* parts = decoded->asArray();
+  std::optional<std::int64_t> kind = parts && parts->size() == 4 ? (*parts)[0].asInt() : std::nullopt;
+  std::optional<std::uint64_t> id = parts && parts->size() == 4 ? (*parts)[1].asUInt() : std::nullopt;
+  const std::string* text = parts && parts->size() == 4 ? (*parts)[2].asString() : nullptr;
+  const ValueArray* values = parts && parts->size() == 4 ? (*parts)[3].asArray() : nullptr;
+  if (!kind || *kind < 0 || *kind > 2 || !id || text == nullptr || values == nullptr) {
+    return malformed("a message that is not [kind, id, text, values]");
+  }
+  message->kind = static_cast<LumoMessage::Kind>(*kind);
+  message->id = *id;
+  message->text = *text;
+  message->values = *values;
+  return Status::Message;
+}
+
+}  // namespace typhora

@@ -1,0 +1,43 @@
+// lumo listeners: the named service socket (bound in the runtime directory, or inherited through
+// systemd socket activation) and anonymous listeners reachable only through their endpoint.
+#pragma once
+
+#include <memory>
+#include <mutex>
+#include <string>
+
+#include "platform/ipc_listener.h"
+#include "platform/linux/unique_fd.h"
+#include "platform/serial_queue.h"
+
+namespace typhora {
+
+class LumoListener final : public IpcListener, public std::enable_shared_from_this<LumoListener> {
+ public:
+  // Listens on `fd` (a bound, listening stream socket).
+  static std::shared_ptr<LumoListener> named(UniqueFd fd, std::string path);
+  // A new anonymous listener with its endpoint.
+  static std::shared_ptr<LumoListener> anonymous();
+
+  void setDelegate(std::weak_ptr<IpcListenerDelegate> delegate) override;
+  void resume() override;
+  void invalidate() override;
+  std::shared_ptr<const IpcEndpoint> endpoint() const override { return endpoint_; }
+
+ private:
+  LumoListener() = default;
+  void onReadable();
+  void offer(UniqueFd fd);
+
+  bool anonymous_ = false;
+  UniqueFd fd_;
+  std::string path_;
+  std::shared_ptr<const IpcEndpoint> endpoint_;
+  std::shared_ptr<SerialQueue> queue_ = SerialQueue::create("com.zorvane.lumo.listener");
+  std::mutex mutex_;
+  std::weak_ptr<IpcListenerDelegate> delegate_;
+  bool resumed_ = false;
+  bool valid_ = true;
+};
+
+}  // namespace typhora

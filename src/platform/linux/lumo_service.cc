@@ -1,0 +1,77 @@
+#include "platform/linux/lumo_service.h"
+
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+
+#include "platform/linux/lumo_connection.h"
+#include "platform/linux/lumo_listener.h"
+#include "platform/log.h"
+
+namespace typhora {
+namespace {
+
+// The activated socket named `name`, or -1. Descriptors handed over are kept for the process.
+int activatedSocket(const std::string& name) {
+  char** names = nullptr;
+  int count = sd_listen_fds_with_names(0, &names);
+  int found = -1;
+  for (int i = 0; i < count; ++i) {
+    // A single socket handed over without a name is taken as the service's own.
+    bool matches = names != nullptr && names[i] != nullptr &&
+                   (name == names[i] || (count == 1 && std::strcmp(names[i], "unknown") == 0));
+    if (matches && found < 0) found = SD_LISTEN_FDS_START + i;
+  }
+  if (names != nullptr) {
+    for (int i = 0; i < count; ++i) std::free(names[i]);
+    std::free(names);
+  }
+  return found;
+}
+
+}  // namespace
+
+LumoService::LumoService(std::string runtimeDir) : runtimeDir_(std::move(runtimeDir)) {}
+
+std::shared_ptr<IpcListener> LumoService::makeNamedListener(const std::string& serviceName) {
+  if (int fd = activatedSocket(serviceName); fd >= 0) {
+    return LumoListener::named(UniqueFd(fd), "");
+  }
+  const std::string path = runtimeDir_ + "/" + serviceName;
+  UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  if (path.size() >= sizeof address.sun_path) {
+    SystemLog("lumo error: %s - %@", "-[LumoService makeNamedListener]", "socket path too long");
+    return nullptr;
+  }
+  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+  unlink(path.c_str());
+  if (bind(fd.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
+      chmod(path.c_str(), 0666) != 0 || listen(fd.get(), 1024) != 0) {
+    SystemLog("lumo error: %s - %@", "-[LumoService makeNamedListener]",
+              path + ": " + std::strerror(errno));
+    return nullptr;
+  }
+  return LumoListener::named(std::move(fd), path);
+}
+
+std::shared_ptr<IpcListener> LumoService::makeAnonymousListener() {
+  return LumoListener::anonymous();
+}
+
+std::shared_ptr<IpcConnection> LumoService::connect(std::shared_ptr<const IpcEndpoint> endpoint) {
+  return LumoConnection::toEndpoint(std::move(endpoint));
+}
+
+std::shared_ptr<IpcConnection> LumoService::connectToService(const std::string& serviceName) {
+  return LumoConnection::toPath(runtimeDir_ + "/" + serviceName);
+}
+
+}  // namespace typhora
