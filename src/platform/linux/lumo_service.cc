@@ -1,5 +1,6 @@
 #include "platform/linux/lumo_service.h"
 
+#include <fcntl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -41,6 +42,9 @@ LumoService::LumoService(std::string runtimeDir) : runtimeDir_(std::move(runtime
 
 std::shared_ptr<IpcListener> LumoService::makeNamedListener(const std::string& serviceName) {
   if (int fd = activatedSocket(serviceName); fd >= 0) {
+    // Inherited sockets come blocking; the I/O loop accepts until it would block.
+    fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK);
+    fcntl(fd, F_SETFD, FD_CLOEXEC);
     return LumoListener::named(UniqueFd(fd), "");
   }
   const std::string path = runtimeDir_ + "/" + serviceName;

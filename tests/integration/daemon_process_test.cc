@@ -1,0 +1,163 @@
+// The real typhorad in a temporary device root, called by real typhoractl processes.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/stat.h>
+
+#include <chrono>
+#include <filesystem>
+#include <fstream>
+#include <memory>
+#include <thread>
+
+#include "integration/child_process.h"
+
+namespace typhora::testing {
+namespace {
+
+namespace fs = std::filesystem;
+using namespace std::chrono_literals;
+using ::testing::HasSubstr;
+
+const std::string kDaemon = std::string(TYPHORA_BINARY_DIR) + "/src/typhorad";
+const std::string kCtl = std::string(TYPHORA_BINARY_DIR) + "/tools/typhoractl";
+constexpr const char* kService = "com.zorvane.typhorad";
+
+class DaemonProcessTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/typhora-it-XXXXXX";
+    ASSERT_NE(mkdtemp(pattern), nullptr);
+    dir_ = pattern;
+    root_ = dir_ / "root";
+    runtime_ = dir_ / "run";
+    fs::create_directories(root_ / "var/mobile/Library/UserFonts");
+    fs::create_directories(runtime_);
+    std::ofstream(root_ / "var/mobile/Library/UserFonts/UserFonts.plist")
+        << R"({"/var/mobile/Library/UserFonts/FontFiles/com.example.shop/A.otf":)"
+        << R"({"familyName": {"A-Regular": "A"}}})";
+  }
+  void TearDown() override {
+    daemon_.reset();
+    fs::remove_all(dir_);
+  }
+
+  std::vector<std::string> daemonArgs() const {
+    return {kDaemon, "--root", root_, "--runtime-dir", runtime_, "--log-level", "debug",
+            "--log-target", "stderr"};
+  }
+
+  void startDaemon() {
+    daemon_ = std::make_unique<ChildProcess>(daemonArgs());
+    waitForSocket();
+  }
+
+  void waitForSocket() {
+    const fs::path socket = runtime_ / kService;
+    for (int i = 0; i < 1000 && !fs::exists(socket); ++i) std::this_thread::sleep_for(5ms);
+    ASSERT_TRUE(fs::exists(socket)) << (daemon_ ? daemon_->output() : "");
+  }
+
+  CommandResult ctl(std::vector<std::string> args) const {
+    std::vector<std::string> argv = {kCtl, "--runtime-dir", runtime_};
+    argv.insert(argv.end(), args.begin(), args.end());
+    return runCommand(argv, 20s);
+  }
+
+  fs::path dir_, root_, runtime_;
+  std::unique_ptr<ChildProcess> daemon_;
+};
+
+TEST_F(DaemonProcessTest, ClientsAreAnsweredAndEachLeavesOneHandlerBehind) {
+  startDaemon();
+  auto result = ctl({"updating-user-fonts"});
+  ASSERT_EQ(result.status, 0) << result.all << daemon_->output();
+  EXPECT_EQ(result.out, "{}\n");
+
+  ASSERT_TRUE(daemon_->waitForLine("TyphoraHandler deallocated.", 10s)) << daemon_->output();
+  std::this_thread::sleep_for(200ms);
+  EXPECT_EQ(daemon_->countLines("TyphoraHandler deallocated."), 1u) << daemon_->output();
+
+  // Several clients at once are all answered, and each goes away once.
+  std::vector<std::thread> clients;
+  std::atomic<int> answered{0};
+  for (int i = 0; i < 8; ++i) {
+    clients.emplace_back([&] { answered += ctl({"call", "updatingUserFonts:"}).status == 0; });
+  }
+  for (auto& t : clients) t.join();
+  EXPECT_EQ(answered.load(), 8);
+  for (int i = 0; i < 500 && daemon_->countLines("TyphoraHandler deallocated.") < 9; ++i) {
+    std::this_thread::sleep_for(10ms);
+  }
+  EXPECT_EQ(daemon_->countLines("TyphoraHandler deallocated."), 9u);
+}
+
+TEST_F(DaemonProcessTest, RefusedOperationsLeaveTheDaemonServing) {
+  startDaemon();
+  // Not an operation of the service at all: refused by the IPC layer before any handler runs.
+  auto unknown = ctl({"call", "--unchecked", "eraseAllFonts:"});
+  EXPECT_NE(unknown.status, 0) << unknown.all;
+  EXPECT_TRUE(daemon_->waitForLine("lumo error:", 5s)) << daemon_->output();
+
+  // A wrong argument type is refused the same way.
+  auto wrongType = ctl({"call", "--unchecked", "scheduleFontFilesDeletion:", "42"});
+  EXPECT_TRUE(daemon_->waitForLine("scheduleFontFilesDeletion:", 5s)) << daemon_->output();
+  (void)wrongType;
+
+  // An operation of the service that the daemon does not carry out is refused as unrecognised.
+  auto checkin = ctl({"call", "checkin:"});
+  EXPECT_NE(checkin.status, 0) << checkin.all;
+
+  auto ok = ctl({"updating-user-fonts"});
+  EXPECT_EQ(ok.status, 0) << ok.all << daemon_->output();
+}
+
+TEST_F(DaemonProcessTest, StartsThroughSocketActivation) {
+  const std::string socket = (runtime_ / kService).string();
+  std::vector<std::string> argv = {"/usr/bin/systemd-socket-activate", "-l", socket,
+                                   std::string("--fdname=") + kService};
+  auto args = daemonArgs();
+  argv.insert(argv.end(), args.begin(), args.end());
+  if (!fs::exists(argv[0])) GTEST_SKIP() << "systemd-socket-activate is not installed";
+  daemon_ = std::make_unique<ChildProcess>(argv);
+  waitForSocket();
+
+  // The daemon starts on the first connection and answers it on the inherited socket.
+  auto result = ctl({"updating-user-fonts"});
+  ASSERT_EQ(result.status, 0) << result.all << daemon_->output();
+  EXPECT_EQ(result.out, "{}\n");
+  EXPECT_TRUE(daemon_->waitForLine("TyphoraHandler deallocated.", 10s)) << daemon_->output();
+}
+
+TEST_F(DaemonProcessTest, ToolsExplainThemselves) {
+  auto daemonHelp = runCommand({kDaemon, "--help"}, 10s);
+  EXPECT_EQ(daemonHelp.status, 0);
+  EXPECT_THAT(daemonHelp.out, HasSubstr("--root"));
+  auto ctlHelp = ctl({"--help"});
+  EXPECT_EQ(ctlHelp.status, 0);
+  EXPECT_THAT(ctlHelp.out, HasSubstr("plist"));
+  auto bad = runCommand({kDaemon, "--no-such-option"}, 10s);
+  EXPECT_EQ(bad.status, 2);
+  EXPECT_THAT(bad.all, HasSubstr("unknown option"));
+}
+
+TEST_F(DaemonProcessTest, PlistFilesConvertBothWays) {
+  const std::string json = (root_ / "var/mobile/Library/UserFonts/UserFonts.plist").string();
+  const std::string cbor = (dir_ / "fonts.cbor").string();
+  const std::string back = (dir_ / "fonts.json").string();
+  ASSERT_EQ(ctl({"plist", "convert", "--to", "cbor", json, cbor}).status, 0);
+  ASSERT_EQ(ctl({"plist", "convert", "--to", "json", cbor, back}).status, 0);
+  auto fromJson = ctl({"plist", "show", json});
+  auto fromCbor = ctl({"plist", "show", cbor});
+  EXPECT_EQ(fromJson.status, 0);
+  EXPECT_EQ(fromJson.out, fromCbor.out);
+  EXPECT_THAT(fromCbor.out, HasSubstr("\"A-Regular\": \"A\""));
+
+  std::ofstream(dir_ / "broken.json") << "{\"unterminated\": ";
+  auto broken = ctl({"plist", "show", (dir_ / "broken.json").string()});
+  EXPECT_EQ(broken.status, 1);
+  EXPECT_THAT(broken.all, HasSubstr("broken.json"));
+}
+
+}  // namespace
+}  // namespace typhora::testing
