@@ -57,7 +57,9 @@ class WorkerPool {
   void submit(StatePtr state) {
     std::lock_guard lock(mutex_);
     ready_.push_back(std::move(state));
-    if (idle_ > 0) {
+    // A woken worker stays counted as idle until it runs, so compare against all ready queues:
+    // each needs an idle worker of its own, or a new one.
+    if (idle_ >= ready_.size()) {
       wake_.notify_one();
     } else if (threads_ < limit_) {
       ++threads_;
