@@ -24,8 +24,10 @@ std::string formatDate(Date date) {
   std::tm tm{};
   gmtime_r(&t, &tm);
   char buffer[64];
-  std::size_t n = std::strftime(buffer, sizeof buffer, "%Y-%m-%dT%H:%M:%S", &tm);
-  std::string out(buffer, n);
+  // Four-digit years, zero-padded, as RFC 3339 has them.
+  std::snprintf(buffer, sizeof buffer, "%04d-%02d-%02dT%02d:%02d:%02d", tm.tm_year + 1900,
+                tm.tm_mon + 1, tm.tm_mday, tm.tm_hour, tm.tm_min, tm.tm_sec);
+  std::string out(buffer);
   if (fraction > 0) {
     char frac[32];
     std::snprintf(frac, sizeof frac, "%.9f", fraction);  // "0.123456789"
@@ -332,6 +334,7 @@ class Reader {
     const std::string* text = entry.second.asString();
     if (text == nullptr) return std::nullopt;
     if (entry.first == kDataKey) {
+      if (text->empty()) return Value(Bytes{});
       Bytes bytes(text->size());
       std::size_t length = 0;
       if (sodium_base642bin(bytes.data(), bytes.size(), text->data(), text->size(), nullptr,

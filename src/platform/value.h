@@ -38,27 +38,7 @@ using Bytes = std::vector<std::uint8_t>;
 using ValueArray = std::vector<Value>;
 using DictionaryEntry = std::pair<std::string, Value>;
 
-// Immutable dictionary: entries sorted by key, unique keys.
-class Dictionary {
- public:
-  Dictionary() = default;
-  // Sorts the entries by key; when a key repeats, the last entry for it wins.
-  explicit Dictionary(std::vector<DictionaryEntry> entries);
-
-  // The value for `key`, or nullptr when there is none.
-  const Value* find(std::string_view key) const;
-  bool contains(std::string_view key) const { return find(key) != nullptr; }
-  std::size_t size() const { return entries_.size(); }
-  bool empty() const { return entries_.empty(); }
-  auto begin() const { return entries_.begin(); }
-  auto end() const { return entries_.end(); }
-  const std::vector<DictionaryEntry>& entries() const { return entries_; }
-
-  friend bool operator==(const Dictionary&, const Dictionary&);
-
- private:
-  std::vector<DictionaryEntry> entries_;
-};
+class Dictionary;
 
 class Value {
  public:
@@ -104,10 +84,8 @@ class Value {
   Value(std::shared_ptr<const IpcEndpoint> endpoint);              // NOLINT
 
   // Builders: Value::array({1, "two"}), Value::dictionary({{"a", 1}, {"b", true}}).
-  static Value array(std::initializer_list<Value> items) { return Value(ValueArray(items)); }
-  static Value dictionary(std::initializer_list<DictionaryEntry> entries) {
-    return Value(Dictionary(std::vector<DictionaryEntry>(entries)));
-  }
+  static Value array(std::initializer_list<Value> items);
+  static Value dictionary(std::initializer_list<DictionaryEntry> entries);
   static Value data(std::span<const std::uint8_t> bytes) {
     return Value(Bytes(bytes.begin(), bytes.end()));
   }
@@ -158,5 +136,33 @@ class Value {
 
 // A shared null Value, for accessors that return references.
 const Value& nullValue();
+
+// Immutable dictionary: entries sorted by key, unique keys.
+class Dictionary {
+ public:
+  Dictionary() = default;
+  // Sorts the entries by key; when a key repeats, the last entry for it wins.
+  explicit Dictionary(std::vector<DictionaryEntry> entries);
+
+  // The value for `key`, or nullptr when there is none.
+  const Value* find(std::string_view key) const;
+  bool contains(std::string_view key) const { return find(key) != nullptr; }
+  std::size_t size() const { return entries_.size(); }
+  bool empty() const { return entries_.empty(); }
+  auto begin() const { return entries_.begin(); }
+  auto end() const { return entries_.end(); }
+  const std::vector<DictionaryEntry>& entries() const { return entries_; }
+
+  friend bool operator==(const Dictionary&, const Dictionary&);
+
+ private:
+  std::vector<DictionaryEntry> entries_;
+};
+
+inline Value Value::array(std::initializer_list<Value> items) { return Value(ValueArray(items)); }
+inline Value Value::dictionary(std::initializer_list<DictionaryEntry> entries) {
+  return Value(Dictionary(std::vector<DictionaryEntry>(entries)));
+}
+
 
 }  // namespace typhora
