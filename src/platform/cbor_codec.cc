@@ -4,6 +4,7 @@
 
 #include <cbor.h>
 
+#include <algorithm>
 #include <cmath>
 #include <cstring>
 #include <limits>
@@ -16,6 +17,34 @@ namespace {
 constexpr std::uint64_t kDateTag = 1;
 
 // ---- Encoding ----
+
+// An upper bound of the encoded size (9 bytes covers any head), so that the output buffer is
+// allocated once: growing a multi-megabyte buffer step by step costs more than encoding it.
+std::size_t sizeBound(const Value& value, std::size_t depth) {
+  if (depth > 256) return 0;  // the encoder refuses such depths anyway
+  switch (value.type()) {
+    case Value::Type::String:
+      return 9 + value.asString()->size();
+    case Value::Type::Data:
+      return 9 + value.asData()->size();
+    case Value::Type::Date:
+      return 18;
+    case Value::Type::Array: {
+      std::size_t n = 9;
+      for (const Value& item : *value.asArray()) n += sizeBound(item, depth + 1);
+      return n;
+    }
+    case Value::Type::Dictionary: {
+      std::size_t n = 9;
+      for (const auto& [key, item] : *value.asDictionary()) {
+        n += 9 + key.size() + sizeBound(item, depth + 1);
+      }
+      return n;
+    }
+    default:
+      return 18;
+  }
+}
 
 class Encoder {
  public:
@@ -68,8 +97,17 @@ class Encoder {
   }
 
  private:
+  // Grows the buffer geometrically ahead of writes: resizing a byte vector a few bytes at a time
+  // otherwise costs more than the encoding itself.
+  void ensure(std::size_t more) {
+    if (out_.capacity() - out_.size() < more) {
+      out_.reserve(std::max(out_.capacity() * 2, out_.size() + more + 4096));
+    }
+  }
+
   template <class F, class... A>
   bool put(F encodeFn, A... args) {
+    ensure(9);
     std::size_t at = out_.size();
     out_.resize(at + 9);
     std::size_t n = encodeFn(args..., out_.data() + at, 9);
@@ -81,6 +119,7 @@ class Encoder {
   bool bytes(std::size_t (*start)(std::size_t, unsigned char*, std::size_t),
              const Container& content) {
     if (!put(start, content.size())) return false;
+    ensure(content.size());
     out_.insert(out_.end(), reinterpret_cast<const std::uint8_t*>(content.data()),
                 reinterpret_cast<const std::uint8_t*>(content.data()) + content.size());
     return true;
@@ -308,6 +347,7 @@ const cbor_callbacks& callbacks() {
 bool CborCodec::encode(const Value& value, Bytes* out, const EndpointHooks* hooks,
                        std::string* error, std::size_t maxDepth) {
   const std::size_t start = out->size();
+  out->reserve(start + sizeBound(value, 0));
   Encoder encoder(out, hooks, error, maxDepth);
   if (encoder.encode(value, 0)) return true;
   out->resize(start);

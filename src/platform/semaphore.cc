@@ -3,10 +3,10 @@
 namespace typhora {
 
 void Semaphore::signal() {
-  {
-    std::lock_guard lock(mutex_);
-    ++count_;
-  }
+  // Notify under the lock: a waiter that wakes may destroy the semaphore as soon as it can take
+  // the mutex, so the notification must be over by then.
+  std::lock_guard lock(mutex_);
+  ++count_;
   cv_.notify_one();
 }
 

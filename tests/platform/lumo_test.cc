@@ -32,7 +32,7 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
 
   class Object final : public IpcExportedObject {
    public:
-    explicit Object(Server& server) : server_(server) {}
+    explicit Object(std::shared_ptr<Server> server) : server_(*server), keep_(std::move(server)) {}
     bool invoke(const IpcOperation& op, const std::vector<Value>& args, IpcReply reply) override {
       server_.lastCaller = IpcConnection::current()->auditToken();
       if (op.wireName == "echo:reply:") reply({args[0]});
@@ -44,14 +44,15 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
 
    private:
     Server& server_;
+    std::shared_ptr<Server> keep_;  // handlers may outlive the test that made the server
   };
 
   bool shouldAcceptNewConnection(IpcListener&, std::shared_ptr<IpcConnection> c) override {
     c->setExportedInterface(lumoTestInterface());
-    c->setExportedObject(std::make_shared<Object>(*this));
-    c->setInvalidationHandler([this] {
-      ++invalidations;
-      invalidated.signal();
+    c->setExportedObject(std::make_shared<Object>(shared_from_this()));
+    c->setInvalidationHandler([self = shared_from_this()] {
+      ++self->invalidations;
+      self->invalidated.signal();
     });
     c->resume();
     ++accepted;

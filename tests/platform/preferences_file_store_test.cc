@@ -74,7 +74,10 @@ TEST_F(PreferencesFileStoreTest, AProcessKilledWhileSynchronizingNeverLeavesATor
         store.synchronize();
       }
     }
-    usleep(static_cast<useconds_t>(2000 + random() % 20000));
+    // Slow builds (sanitizers) take a while to write the first file: wait for it, then kill
+    // at a random moment of the storm.
+    for (int i = 0; i < 5000 && !fs::exists(path_); ++i) usleep(1000);
+    usleep(static_cast<useconds_t>(random() % 20000));
     kill(child, SIGKILL);
     waitpid(child, nullptr, 0);
     if (!fs::exists(path_)) continue;  // killed before its first rename

@@ -1,0 +1,88 @@
+// Encoding and decoding a user-fonts dictionary of 10,000 records in CBOR and JSON.
+#include <benchmark/benchmark.h>
+
+#include "platform/cbor_codec.h"
+#include "platform/json_codec.h"
+
+namespace typhora {
+namespace {
+
+Value userFonts() {
+  std::vector<DictionaryEntry> records;
+  for (int i = 0; i < 10'000; ++i) {
+    std::vector<DictionaryEntry> names;
+    const std::string family = "Font " + std::to_string(i);
+    const char* styles[] = {"Regular", "Bold", "Italic", "BoldItalic"};
+    for (int k = 0; k < 1 + i % 4; ++k) {
+      names.emplace_back("Font" + std::to_string(i) + "-" + styles[k], family);
+    }
+    records.emplace_back(
+        "/var/mobile/Library/UserFonts/FontFiles/com.example.provider" + std::to_string(i % 40) +
+            "/Font" + std::to_string(i) + "-Regular.otf",
+        Value::dictionary({{"familyName", Value(Dictionary(std::move(names)))},
+                           {"disabled", Value(i % 5 == 0)},
+                           {"fontAssetName", Value(family)},
+                           {"installDate", Value(Date{1.7e9 + i * 60.0})},
+                           {"fileSize", Value(40'000 + i)}}));
+  }
+  return Value(Dictionary(std::move(records)));
+}
+
+const Value& fonts() {
+  static const Value v = userFonts();
+  return v;
+}
+
+void report(benchmark::State& state, std::size_t bytes) {
+  state.SetBytesProcessed(static_cast<std::int64_t>(state.iterations() * bytes));
+  state.counters["bytes"] = static_cast<double>(bytes);
+}
+
+void BM_CborEncode(benchmark::State& state) {
+  std::size_t size = 0;
+  for (auto _ : state) {
+    Bytes out = CborCodec::encode(fonts());
+    size = out.size();
+    benchmark::DoNotOptimize(out.data());
+  }
+  report(state, size);
+}
+
+void BM_CborDecode(benchmark::State& state) {
+  const Bytes encoded = CborCodec::encode(fonts());
+  DecodeLimits limits;
+  for (auto _ : state) {
+    auto v = CborCodec::decode(encoded, limits);
+    benchmark::DoNotOptimize(v);
+  }
+  report(state, encoded.size());
+}
+
+void BM_JsonEncode(benchmark::State& state) {
+  std::size_t size = 0;
+  for (auto _ : state) {
+    std::string out = JsonCodec::encode(fonts());
+    size = out.size();
+    benchmark::DoNotOptimize(out.data());
+  }
+  report(state, size);
+}
+
+void BM_JsonDecode(benchmark::State& state) {
+  const std::string encoded = JsonCodec::encode(fonts());
+  for (auto _ : state) {
+    auto v = JsonCodec::decode(encoded);
+    benchmark::DoNotOptimize(v);
+  }
+  report(state, encoded.size());
+}
+
+BENCHMARK(BM_CborEncode)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_CborDecode)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_JsonEncode)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_JsonDecode)->Unit(benchmark::kMillisecond);
+
+}  // namespace
+}  // namespace typhora
+
+BENCHMARK_MAIN();
