@@ -34,14 +34,13 @@ Value userFontsOf(int records) {
     for (int k = 0; k < 1 + i % 4; ++k) {
       names.emplace_back("Family" + std::to_string(i) + "-Style" + std::to_string(k), family);
     }
-    entries.emplace_back(
-        "/var/mobile/Library/UserFonts/FontFiles/com.example.provider" + std::to_string(i % 50) +
-            "/Family" + std::to_string(i) + ".otf",
-        Value::dictionary({{"familyName", Value(Dictionary(std::move(names)))},
-                           {"disabled", Value(i % 7 == 0)},
-                           {"fontAssetName", Value(family)},
-                           {"installDate", Value(Date{1.7e9 + i})},
-                           {"fileSize", Value(100'000 + i)}}));
+    entries.emplace_back("/var/mobile/Library/UserFonts/FontFiles/com.example.provider" +
+                             std::to_string(i % 50) + "/Family" + std::to_string(i) + ".otf",
+                         Value::dictionary({{"familyName", Value(Dictionary(std::move(names)))},
+                                            {"disabled", Value(i % 7 == 0)},
+                                            {"fontAssetName", Value(family)},
+                                            {"installDate", Value(Date{1.7e9 + i})},
+                                            {"fileSize", Value(100'000 + i)}}));
   }
   return Value(Dictionary(std::move(entries)));
 }
@@ -55,7 +54,8 @@ struct Device {
     fs::create_directories(dir / "run");
     Bytes bytes = CborCodec::encode(userFontsOf(10'000));
     std::ofstream(dir / "root/var/mobile/Library/UserFonts/UserFonts.plist", std::ios::binary)
-        .write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
+        .write(reinterpret_cast<const char*>(bytes.data()),
+               static_cast<std::streamsize>(bytes.size()));
   }
   ~Device() { fs::remove_all(dir); }
 };
@@ -124,7 +124,10 @@ void BM_ColdStartToFirstAnsweredCall(benchmark::State& state) {
   }
   state.counters["daemon_rss_MB"] = static_cast<double>(rss) / 1024.0;
 }
-BENCHMARK(BM_ColdStartToFirstAnsweredCall)->UseManualTime()->Unit(benchmark::kMillisecond)->Iterations(20);
+BENCHMARK(BM_ColdStartToFirstAnsweredCall)
+    ->UseManualTime()
+    ->Unit(benchmark::kMillisecond)
+    ->Iterations(20);
 
 }  // namespace
 }  // namespace typhora

@@ -16,14 +16,13 @@ Value userFonts() {
     for (int k = 0; k < 1 + i % 4; ++k) {
       names.emplace_back("Font" + std::to_string(i) + "-" + styles[k], family);
     }
-    records.emplace_back(
-        "/var/mobile/Library/UserFonts/FontFiles/com.example.provider" + std::to_string(i % 40) +
-            "/Font" + std::to_string(i) + "-Regular.otf",
-        Value::dictionary({{"familyName", Value(Dictionary(std::move(names)))},
-                           {"disabled", Value(i % 5 == 0)},
-                           {"fontAssetName", Value(family)},
-                           {"installDate", Value(Date{1.7e9 + i * 60.0})},
-                           {"fileSize", Value(40'000 + i)}}));
+    records.emplace_back("/var/mobile/Library/UserFonts/FontFiles/com.example.provider" +
+                             std::to_string(i % 40) + "/Font" + std::to_string(i) + "-Regular.otf",
+                         Value::dictionary({{"familyName", Value(Dictionary(std::move(names)))},
+                                            {"disabled", Value(i % 5 == 0)},
+                                            {"fontAssetName", Value(family)},
+                                            {"installDate", Value(Date{1.7e9 + i * 60.0})},
+                                            {"fileSize", Value(40'000 + i)}}));
   }
   return Value(Dictionary(std::move(records)));
 }

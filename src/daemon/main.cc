@@ -1,11 +1,11 @@
 // typhorad: the font access daemon. Builds the Linux platform, starts the daemon in its fixed
 // order and hands the main thread to the main queue for good.
+#include <unistd.h>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <string>
-#include <unistd.h>
 
 #include "daemon/typhora_daemon.h"
 #include "platform/linux/linux_platform.h"
@@ -36,10 +36,14 @@ struct Options {
 }
 
 bool parseLevel(const std::string& text, typhora::LogLevel* level) {
-  if (text == "debug") *level = typhora::LogLevel::Debug;
-  else if (text == "info") *level = typhora::LogLevel::Info;
-  else if (text == "error") *level = typhora::LogLevel::Error;
-  else return false;
+  if (text == "debug")
+    *level = typhora::LogLevel::Debug;
+  else if (text == "info")
+    *level = typhora::LogLevel::Info;
+  else if (text == "error")
+    *level = typhora::LogLevel::Error;
+  else
+    return false;
   return true;
 }
 

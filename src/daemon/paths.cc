@@ -49,9 +49,15 @@ const std::string& fontAssetsDirectoryPrefix() {
   return prefix;
 }
 
-bool isFontFilePath(std::string_view path) { return path.starts_with(kFontFilesDirectory); }
-bool isFontAssetPath(std::string_view path) { return path.starts_with(kFontAssetsDirectory); }
-bool isAssetStorePath(std::string_view path) { return path.starts_with(kAssetStoreDirectory); }
+bool isFontFilePath(std::string_view path) {
+  return path.starts_with(kFontFilesDirectory);
+}
+bool isFontAssetPath(std::string_view path) {
+  return path.starts_with(kFontAssetsDirectory);
+}
+bool isAssetStorePath(std::string_view path) {
+  return path.starts_with(kAssetStoreDirectory);
+}
 
 // The update queue serialises every update of the user-fonts information: the reading of the
 // file and the replies to clients' updatingUserFonts: calls.

@@ -29,7 +29,9 @@ TyphoraDaemon::TyphoraDaemon(Platform& platform)
 
 TyphoraDaemon::~TyphoraDaemon() = default;
 
-void TyphoraDaemon::installPlatform(Platform& platform) { installedPlatform = &platform; }
+void TyphoraDaemon::installPlatform(Platform& platform) {
+  installedPlatform = &platform;
+}
 
 TyphoraDaemon& TyphoraDaemon::sharedDaemon() {
   // A function-local static is made once, safely against concurrent first calls. The daemon is
@@ -74,7 +76,9 @@ void TyphoraDaemon::setup() {
   platform_.preferences.synchronize();
 }
 
-void TyphoraDaemon::run() { platform_.mainQueue.run(); }
+void TyphoraDaemon::run() {
+  platform_.mainQueue.run();
+}
 
 Value TyphoraDaemon::blacklistInfo() const {
   std::lock_guard lock(blacklistInfoMutex_);

@@ -17,7 +17,9 @@ constexpr const char* kHandlerDeallocated = "TyphoraHandler deallocated.";
 TyphoraHandler::TyphoraHandler(std::shared_ptr<TyphoraDaemon> server)
     : server_(std::move(server)) {}
 
-TyphoraHandler::~TyphoraHandler() { TYLog_Debug(kTYLogTyphoraDaemon, kHandlerDeallocated); }
+TyphoraHandler::~TyphoraHandler() {
+  TYLog_Debug(kTYLogTyphoraDaemon, kHandlerDeallocated);
+}
 
 bool TyphoraHandler::invoke(const IpcOperation& operation, const std::vector<Value>& arguments,
                             IpcReply reply) {

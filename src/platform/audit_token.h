@@ -4,9 +4,9 @@
 // every query made with it fails.
 #pragma once
 
+#include <sys/types.h>
 #include <cstdint>
 #include <string>
-#include <sys/types.h>
 
 namespace typhora {
 

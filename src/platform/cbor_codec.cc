@@ -159,7 +159,8 @@ struct Frame {
 
 class Builder {
  public:
-  Builder(const DecodeLimits& limits, const EndpointHooks* hooks) : limits_(limits), hooks_(hooks) {}
+  Builder(const DecodeLimits& limits, const EndpointHooks* hooks)
+      : limits_(limits), hooks_(hooks) {}
 
   bool failed() const { return !error_.empty(); }
   const std::string& error() const { return error_; }
@@ -308,7 +309,9 @@ class Builder {
   std::string error_;
 };
 
-Builder& of(void* context) { return *static_cast<Builder*>(context); }
+Builder& of(void* context) {
+  return *static_cast<Builder*>(context);
+}
 
 const cbor_callbacks& callbacks() {
   static const cbor_callbacks table = [] {

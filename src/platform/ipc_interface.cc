@@ -5,16 +5,26 @@ namespace typhora {
 bool IpcType::accepts(const Value& v) const {
   if (v.isNull()) return nullable || kind == Kind::Any;
   switch (kind) {
-    case Kind::Any: return true;
-    case Kind::Bool: return v.type() == Value::Type::Bool;
-    case Kind::Integer: return v.type() == Value::Type::Int || v.type() == Value::Type::UInt;
-    case Kind::Number: return v.isNumber();
-    case Kind::String: return v.type() == Value::Type::String;
-    case Kind::Data: return v.type() == Value::Type::Data;
-    case Kind::Date: return v.type() == Value::Type::Date;
-    case Kind::Array: return v.type() == Value::Type::Array;
-    case Kind::Dictionary: return v.type() == Value::Type::Dictionary;
-    case Kind::Endpoint: return v.type() == Value::Type::Endpoint;
+    case Kind::Any:
+      return true;
+    case Kind::Bool:
+      return v.type() == Value::Type::Bool;
+    case Kind::Integer:
+      return v.type() == Value::Type::Int || v.type() == Value::Type::UInt;
+    case Kind::Number:
+      return v.isNumber();
+    case Kind::String:
+      return v.type() == Value::Type::String;
+    case Kind::Data:
+      return v.type() == Value::Type::Data;
+    case Kind::Date:
+      return v.type() == Value::Type::Date;
+    case Kind::Array:
+      return v.type() == Value::Type::Array;
+    case Kind::Dictionary:
+      return v.type() == Value::Type::Dictionary;
+    case Kind::Endpoint:
+      return v.type() == Value::Type::Endpoint;
   }
   return false;
 }

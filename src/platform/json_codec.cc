@@ -53,8 +53,8 @@ std::optional<Date> parseDate(std::string_view s) {
   int year, month, day, hour, minute, second;
   if (!digitsAt(s, 0, 4, &year) || s.size() < 19 || s[4] != '-' || !digitsAt(s, 5, 2, &month) ||
       s[7] != '-' || !digitsAt(s, 8, 2, &day) || (s[10] != 'T' && s[10] != 't') ||
-      !digitsAt(s, 11, 2, &hour) || s[13] != ':' || !digitsAt(s, 14, 2, &minute) ||
-      s[16] != ':' || !digitsAt(s, 17, 2, &second)) {
+      !digitsAt(s, 11, 2, &hour) || s[13] != ':' || !digitsAt(s, 14, 2, &minute) || s[16] != ':' ||
+      !digitsAt(s, 17, 2, &second)) {
     return std::nullopt;
   }
   if (month < 1 || month > 12 || day < 1 || day > 31 || hour > 23 || minute > 59 || second > 60) {
@@ -160,13 +160,27 @@ class Writer {
     for (char ch : s) {
       auto c = static_cast<unsigned char>(ch);
       switch (c) {
-        case '"': out_ += "\\\""; break;
-        case '\\': out_ += "\\\\"; break;
-        case '\n': out_ += "\\n"; break;
-        case '\r': out_ += "\\r"; break;
-        case '\t': out_ += "\\t"; break;
-        case '\b': out_ += "\\b"; break;
-        case '\f': out_ += "\\f"; break;
+        case '"':
+          out_ += "\\\"";
+          break;
+        case '\\':
+          out_ += "\\\\";
+          break;
+        case '\n':
+          out_ += "\\n";
+          break;
+        case '\r':
+          out_ += "\\r";
+          break;
+        case '\t':
+          out_ += "\\t";
+          break;
+        case '\b':
+          out_ += "\\b";
+          break;
+        case '\f':
+          out_ += "\\f";
+          break;
         default:
           if (c < 0x20) {
             char escape[8];

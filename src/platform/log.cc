@@ -25,9 +25,12 @@ std::shared_ptr<LogSink>& currentSink() {
 
 const char* levelName(LogLevel level) {
   switch (level) {
-    case LogLevel::Debug: return "debug";
-    case LogLevel::Info: return "info";
-    case LogLevel::Error: return "error";
+    case LogLevel::Debug:
+      return "debug";
+    case LogLevel::Info:
+      return "info";
+    case LogLevel::Error:
+      return "error";
   }
   return "info";
 }
@@ -35,7 +38,8 @@ const char* levelName(LogLevel level) {
 std::string timestamp() {
   auto now = std::chrono::system_clock::now();
   std::time_t seconds = std::chrono::system_clock::to_time_t(now);
-  auto millis = std::chrono::duration_cast<std::chrono::milliseconds>(now.time_since_epoch()) % 1000;
+  auto millis =
+      std::chrono::duration_cast<std::chrono::milliseconds>(now.time_since_epoch()) % 1000;
   std::tm tm{};
   gmtime_r(&seconds, &tm);
   char buffer[40];
@@ -64,7 +68,9 @@ class StderrSink final : public LogSink {
 class JournalSink final : public LogSink {
  public:
   void write(LogLevel level, const LogCategory* category, std::string_view message) override {
-    int priority = level == LogLevel::Error ? LOG_ERR : level == LogLevel::Debug ? LOG_DEBUG : LOG_INFO;
+    int priority = level == LogLevel::Error   ? LOG_ERR
+                   : level == LogLevel::Debug ? LOG_DEBUG
+                                              : LOG_INFO;
     std::string text(message);
     sd_journal_send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", priority,
                     "SYSLOG_IDENTIFIER=typhorad", "TYPHORA_CATEGORY=%s",
@@ -142,11 +148,19 @@ std::shared_ptr<LogSink> setLogSink(std::shared_ptr<LogSink> sink) {
   return std::exchange(currentSink(), std::move(sink));
 }
 
-void setLogLevel(LogLevel level) { minimumLevel = level; }
-LogLevel logLevel() { return minimumLevel; }
+void setLogLevel(LogLevel level) {
+  minimumLevel = level;
+}
+LogLevel logLevel() {
+  return minimumLevel;
+}
 
-std::shared_ptr<LogSink> makeStderrLogSink() { return std::make_shared<StderrSink>(); }
-std::shared_ptr<LogSink> makeJournalLogSink() { return std::make_shared<JournalSink>(); }
+std::shared_ptr<LogSink> makeStderrLogSink() {
+  return std::make_shared<StderrSink>();
+}
+std::shared_ptr<LogSink> makeJournalLogSink() {
+  return std::make_shared<JournalSink>();
+}
 
 void logWrite(LogLevel level, const LogCategory* category, std::string_view format,
               std::initializer_list<LogArg> args) {

@@ -38,11 +38,11 @@ class LogSink {
 // One formatting argument.
 class LogArg {
  public:
-  LogArg(const Value& v) : v_(v.description()) {}  // NOLINT
-  LogArg(const std::string& s) : v_(s) {}           // NOLINT
-  LogArg(std::string_view s) : v_(std::string(s)) {}  // NOLINT
+  LogArg(const Value& v) : v_(v.description()) {}               // NOLINT
+  LogArg(const std::string& s) : v_(s) {}                       // NOLINT
+  LogArg(std::string_view s) : v_(std::string(s)) {}            // NOLINT
   LogArg(const char* s) : v_(std::string(s ? s : "(null)")) {}  // NOLINT
-  LogArg(double d) : v_(d) {}                       // NOLINT
+  LogArg(double d) : v_(d) {}                                   // NOLINT
   template <class T, std::enable_if_t<std::is_integral_v<T>, int> = 0>
   LogArg(T i) {  // NOLINT
     if constexpr (std::is_signed_v<T>) {
@@ -54,9 +54,7 @@ class LogArg {
   template <class T, class = decltype(std::declval<const T&>().description())>
   LogArg(const T& object) : v_(std::string(object.description())) {}  // NOLINT
 
-  const std::variant<std::string, std::int64_t, std::uint64_t, double>& value() const {
-    return v_;
-  }
+  const std::variant<std::string, std::int64_t, std::uint64_t, double>& value() const { return v_; }
 
  private:
   std::variant<std::string, std::int64_t, std::uint64_t, double> v_;

@@ -41,9 +41,10 @@ void ManualClock::advance(Duration by) {
   const Duration target = uptime_ + by;
   for (;;) {
     std::erase_if(alarms_, [](const auto& a) { return a->cancelled.load(); });
-    auto earliest = std::min_element(alarms_.begin(), alarms_.end(), [](const auto& a, const auto& b) {
-      return a->deadline != b->deadline ? a->deadline < b->deadline : a->sequence < b->sequence;
-    });
+    auto earliest =
+        std::min_element(alarms_.begin(), alarms_.end(), [](const auto& a, const auto& b) {
+          return a->deadline != b->deadline ? a->deadline < b->deadline : a->sequence < b->sequence;
+        });
     if (earliest == alarms_.end() || (*earliest)->deadline > target) break;
     std::shared_ptr<Alarm> alarm = *earliest;
     alarms_.erase(earliest);

@@ -2,8 +2,8 @@
 
 namespace typhora {
 
-std::shared_ptr<OneShotTimer> OneShotTimer::create(std::shared_ptr<SerialQueue> queue,
-                                                   Clock& clock, std::function<void()> handler) {
+std::shared_ptr<OneShotTimer> OneShotTimer::create(std::shared_ptr<SerialQueue> queue, Clock& clock,
+                                                   std::function<void()> handler) {
   return std::shared_ptr<OneShotTimer>(
       new OneShotTimer(std::move(queue), clock, std::move(handler)));
 }

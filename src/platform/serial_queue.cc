@@ -180,9 +180,13 @@ SerialQueue& SerialQueue::main() {
   return **queue;
 }
 
-const std::string& SerialQueue::label() const { return state_->label; }
+const std::string& SerialQueue::label() const {
+  return state_->label;
+}
 
-void SerialQueue::async(Job job) { enqueue(state_, std::move(job)); }
+void SerialQueue::async(Job job) {
+  enqueue(state_, std::move(job));
+}
 
 void SerialQueue::sync(const Job& job) {
   if (isRunning(state_.get())) {
@@ -223,11 +227,14 @@ void SerialQueue::sync(const Job& job) {
 
 void SerialQueue::asyncAfter(Duration delay, Job job) {
   std::shared_ptr<State> state = state_;
-  state_->clock->schedule(delay, Duration::zero(),
-                          [state, job = std::move(job)]() mutable { enqueue(state, std::move(job)); });
+  state_->clock->schedule(delay, Duration::zero(), [state, job = std::move(job)]() mutable {
+    enqueue(state, std::move(job));
+  });
 }
 
-bool SerialQueue::isCurrent() const { return isRunning(state_.get()); }
+bool SerialQueue::isCurrent() const {
+  return isRunning(state_.get());
+}
 
 void SerialQueue::assertCurrent(const char* where) const {
   if (!isCurrent()) {
@@ -272,7 +279,11 @@ std::size_t SerialQueue::runUntilIdle() {
   }
 }
 
-void SerialQueue::setPoolLimit(std::size_t limit) { WorkerPool::shared().setLimit(limit); }
-std::size_t SerialQueue::poolThreadCount() { return WorkerPool::shared().threads(); }
+void SerialQueue::setPoolLimit(std::size_t limit) {
+  WorkerPool::shared().setLimit(limit);
+}
+std::size_t SerialQueue::poolThreadCount() {
+  return WorkerPool::shared().threads();
+}
 
 }  // namespace typhora

@@ -9,7 +9,9 @@
 namespace typhora {
 namespace {
 
-bool keyLess(const DictionaryEntry& a, const DictionaryEntry& b) { return a.first < b.first; }
+bool keyLess(const DictionaryEntry& a, const DictionaryEntry& b) {
+  return a.first < b.first;
+}
 
 }  // namespace
 
@@ -29,13 +31,16 @@ Dictionary::Dictionary(std::vector<DictionaryEntry> entries) : entries_(std::mov
 }
 
 const Value* Dictionary::find(std::string_view key) const {
-  auto it = std::lower_bound(entries_.begin(), entries_.end(), key,
-                             [](const DictionaryEntry& e, std::string_view k) { return e.first < k; });
+  auto it =
+      std::lower_bound(entries_.begin(), entries_.end(), key,
+                       [](const DictionaryEntry& e, std::string_view k) { return e.first < k; });
   if (it == entries_.end() || it->first != key) return nullptr;
   return &it->second;
 }
 
-bool operator==(const Dictionary& a, const Dictionary& b) { return a.entries_ == b.entries_; }
+bool operator==(const Dictionary& a, const Dictionary& b) {
+  return a.entries_ == b.entries_;
+}
 
 Value::Value(Bytes data) : v_(std::make_shared<const Bytes>(std::move(data))) {}
 Value::Value(ValueArray array) : v_(std::make_shared<const ValueArray>(std::move(array))) {}
@@ -52,7 +57,9 @@ void Value::setUnsigned(std::uint64_t u) {
   }
 }
 
-Value::Type Value::type() const { return static_cast<Type>(v_.index()); }
+Value::Type Value::type() const {
+  return static_cast<Type>(v_.index());
+}
 
 bool Value::isNumber() const {
   Type t = type();
@@ -82,7 +89,9 @@ std::optional<double> Value::asDouble() const {
   return std::nullopt;
 }
 
-const std::string* Value::asString() const { return std::get_if<std::string>(&v_); }
+const std::string* Value::asString() const {
+  return std::get_if<std::string>(&v_);
+}
 
 const Bytes* Value::asData() const {
   auto* p = std::get_if<std::shared_ptr<const Bytes>>(&v_);
@@ -127,8 +136,9 @@ const Value& Value::at(std::size_t index) const {
 Value Value::with(std::string_view key, Value value) const {
   std::vector<DictionaryEntry> entries;
   if (const Dictionary* dict = asDictionary()) entries = dict->entries();
-  auto it = std::lower_bound(entries.begin(), entries.end(), key,
-                             [](const DictionaryEntry& e, std::string_view k) { return e.first < k; });
+  auto it =
+      std::lower_bound(entries.begin(), entries.end(), key,
+                       [](const DictionaryEntry& e, std::string_view k) { return e.first < k; });
   const bool present = it != entries.end() && it->first == key;
   if (value.isNull()) {
     if (present) entries.erase(it);

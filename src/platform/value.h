@@ -45,8 +45,8 @@ class Value {
   enum class Type {
     Null,
     Bool,
-    Int,     // signed 64-bit
-    UInt,    // unsigned 64-bit above INT64_MAX; smaller unsigned values are stored as Int
+    Int,   // signed 64-bit
+    UInt,  // unsigned 64-bit above INT64_MAX; smaller unsigned values are stored as Int
     Double,
     String,
     Data,
@@ -62,10 +62,9 @@ class Value {
   // Booleans only from a real bool (a pointer or an int never becomes a boolean).
   template <class T, std::enable_if_t<std::is_same_v<T, bool>, int> = 0>
   Value(T b) : v_(b) {}  // NOLINT(google-explicit-constructor)
-  template <class T,
-            std::enable_if_t<std::is_integral_v<T> && !std::is_same_v<T, bool> &&
-                                 !std::is_same_v<T, char>,
-                             int> = 0>
+  template <class T, std::enable_if_t<std::is_integral_v<T> && !std::is_same_v<T, bool> &&
+                                          !std::is_same_v<T, char>,
+                                      int> = 0>
   Value(T i) {  // NOLINT(google-explicit-constructor)
     if constexpr (std::is_signed_v<T>) {
       v_ = static_cast<std::int64_t>(i);
@@ -73,15 +72,15 @@ class Value {
       setUnsigned(static_cast<std::uint64_t>(i));
     }
   }
-  Value(double d) : v_(d) {}                                       // NOLINT
-  Value(const char* s) : v_(std::string(s)) {}                     // NOLINT
-  Value(std::string s) : v_(std::move(s)) {}                       // NOLINT
-  Value(std::string_view s) : v_(std::string(s)) {}                // NOLINT
-  Value(Bytes data);                                               // NOLINT
-  Value(Date d) : v_(d) {}                                         // NOLINT
-  Value(ValueArray array);                                         // NOLINT
-  Value(Dictionary dict);                                          // NOLINT
-  Value(std::shared_ptr<const IpcEndpoint> endpoint);              // NOLINT
+  Value(double d) : v_(d) {}                           // NOLINT
+  Value(const char* s) : v_(std::string(s)) {}         // NOLINT
+  Value(std::string s) : v_(std::move(s)) {}           // NOLINT
+  Value(std::string_view s) : v_(std::string(s)) {}    // NOLINT
+  Value(Bytes data);                                   // NOLINT
+  Value(Date d) : v_(d) {}                             // NOLINT
+  Value(ValueArray array);                             // NOLINT
+  Value(Dictionary dict);                              // NOLINT
+  Value(std::shared_ptr<const IpcEndpoint> endpoint);  // NOLINT
 
   // Builders: Value::array({1, "two"}), Value::dictionary({{"a", 1}, {"b", true}}).
   static Value array(std::initializer_list<Value> items);
@@ -159,10 +158,11 @@ class Dictionary {
   std::vector<DictionaryEntry> entries_;
 };
 
-inline Value Value::array(std::initializer_list<Value> items) { return Value(ValueArray(items)); }
+inline Value Value::array(std::initializer_list<Value> items) {
+  return Value(ValueArray(items));
+}
 inline Value Value::dictionary(std::initializer_list<DictionaryEntry> entries) {
   return Value(Dictionary(std::vector<DictionaryEntry>(entries)));
 }
-
 
 }  // namespace typhora

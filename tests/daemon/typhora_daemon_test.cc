@@ -25,7 +25,9 @@ constexpr const char* kFontsJson =
 
 class DaemonTest : public ::testing::Test {
  protected:
-  std::shared_ptr<TyphoraDaemon> makeDaemon() { return std::make_shared<TyphoraDaemon>(fake.platform); }
+  std::shared_ptr<TyphoraDaemon> makeDaemon() {
+    return std::make_shared<TyphoraDaemon>(fake.platform);
+  }
 
   FakePlatform fake;
 };
@@ -57,13 +59,14 @@ TEST_P(MigrationTest, ResetsAndWritesVersionOneOnlyBelowOne) {
   }
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Versions, MigrationTest,
-    ::testing::Values(MigrationCase{"absent", Value(), true}, MigrationCase{"minus1", Value(-1), true},
-                      MigrationCase{"zero", Value(0), true}, MigrationCase{"one", Value(1), false},
-                      MigrationCase{"five", Value(5), false},
-                      MigrationCase{"text", Value("7"), true}),
-    [](const auto& testCase) { return std::string(testCase.param.name); });
+INSTANTIATE_TEST_SUITE_P(Versions, MigrationTest,
+                         ::testing::Values(MigrationCase{"absent", Value(), true},
+                                           MigrationCase{"minus1", Value(-1), true},
+                                           MigrationCase{"zero", Value(0), true},
+                                           MigrationCase{"one", Value(1), false},
+                                           MigrationCase{"five", Value(5), false},
+                                           MigrationCase{"text", Value("7"), true}),
+                         [](const auto& testCase) { return std::string(testCase.param.name); });
 
 // ---- The one daemon ----
 

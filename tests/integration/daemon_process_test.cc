@@ -43,8 +43,8 @@ class DaemonProcessTest : public ::testing::Test {
   }
 
   std::vector<std::string> daemonArgs() const {
-    return {kDaemon, "--root", root_, "--runtime-dir", runtime_, "--log-level", "debug",
-            "--log-target", "stderr"};
+    return {kDaemon,       "--root", root_,          "--runtime-dir", runtime_,
+            "--log-level", "debug",  "--log-target", "stderr"};
   }
 
   void startDaemon() {

@@ -51,7 +51,8 @@ int rawConnect(const std::string& dir) {
   return fd;
 }
 
-std::vector<std::uint8_t> frameOf(const std::string& op, std::vector<Value> args, std::uint64_t id) {
+std::vector<std::uint8_t> frameOf(const std::string& op, std::vector<Value> args,
+                                  std::uint64_t id) {
   std::vector<std::uint8_t> frame;
   std::vector<int> fds;
   std::string error;
@@ -127,8 +128,11 @@ int main(int argc, char** argv) {
     c->setRemoteInterface(lumoTestInterface());
     c->resume();
     Value answer;
-    c->synchronousRemoteObjectProxy([](const std::string& e) { std::cerr << e << "\n"; })
-        ->call("useEndpoint:reply:", {endpoint.at(0)}, [&](std::vector<Value> r) { answer = r.at(0); });
+    c->synchronousRemoteObjectProxy([](const std::string& e) {
+       std::cerr << e << "\n";
+     })->call("useEndpoint:reply:", {endpoint.at(0)}, [&](std::vector<Value> r) {
+      answer = r.at(0);
+    });
     std::cout << answer.description() << std::endl;
     return answer.isNull() ? 1 : 0;
   }

@@ -199,7 +199,8 @@ TEST_F(LumoTest, ATokenStopsValidatingOnceItsProcessExecsAnotherProgram) {
   }
   AuditToken token = server_->lastCaller;
   ASSERT_EQ(token.pid, child.pid());
-  for (int i = 0; i < 500 && ProcessIdentity::isValid(token); ++i) std::this_thread::sleep_for(10ms);
+  for (int i = 0; i < 500 && ProcessIdentity::isValid(token); ++i)
+    std::this_thread::sleep_for(10ms);
   EXPECT_FALSE(ProcessIdentity::isValid(token));
   EXPECT_FALSE(ProcessIdentity::executablePath(token));
   // The test process's own token stays valid; the zero token never is.

@@ -196,7 +196,8 @@ TEST(PlistReader, ReadsEitherEncodingFromAFile) {
   std::ofstream(json) << "  " << JsonCodec::encode(everything(), true);
   Bytes bytes = CborCodec::encode(everything());
   std::ofstream(cbor, std::ios::binary)
-      .write(reinterpret_cast<const char*>(bytes.data()), static_cast<std::streamsize>(bytes.size()));
+      .write(reinterpret_cast<const char*>(bytes.data()),
+             static_cast<std::streamsize>(bytes.size()));
   EXPECT_EQ(PlistReader::readFile(json), everything());
   EXPECT_EQ(PlistReader::readFile(cbor), everything());
   std::string error;

@@ -23,7 +23,8 @@ class FakeIpcConnection final : public IpcConnection {
   void invalidate() override;
   bool isValid() const override;
   std::shared_ptr<IpcRemoteProxy> remoteObjectProxy(IpcErrorHandler errorHandler) override;
-  std::shared_ptr<IpcRemoteProxy> synchronousRemoteObjectProxy(IpcErrorHandler errorHandler) override;
+  std::shared_ptr<IpcRemoteProxy> synchronousRemoteObjectProxy(
+      IpcErrorHandler errorHandler) override;
   AuditToken auditToken() const override { return token_; }
 
   // What an incoming message would do: refused (nullopt, with `error`) when the operation is

@@ -31,8 +31,8 @@ struct CallResult {
 // An interface describing just `wireName` with untyped arguments, to send what the user typed.
 std::shared_ptr<const IpcInterface> uncheckedInterface(const std::string& wireName,
                                                        std::size_t argumentCount) {
-  IpcOperation operation{wireName, std::vector<IpcType>(argumentCount, IpcType{IpcType::Kind::Any, true}),
-                         true, {}};
+  IpcOperation operation{
+      wireName, std::vector<IpcType>(argumentCount, IpcType{IpcType::Kind::Any, true}), true, {}};
   return std::make_shared<const IpcInterface>("unchecked", std::vector<IpcOperation>{operation});
 }
 
@@ -109,8 +109,7 @@ int runClientCommand(const ClientOptions& options, const std::vector<std::string
     return 0;
   }
   if (command == "updating-user-fonts") {
-    CallResult result =
-        callService(options, typhoraDaemonProtocol(), op::kUpdatingUserFonts, {});
+    CallResult result = callService(options, typhoraDaemonProtocol(), op::kUpdatingUserFonts, {});
     if (!result.ok) return printCall(result);
     std::cout << "{}\n";
     return 0;

@@ -10,7 +10,9 @@ LinuxFileSystem::LinuxFileSystem(std::string root) : root_(std::move(root)) {
   while (!root_.empty() && root_.back() == '/') root_.pop_back();
 }
 
-std::string LinuxFileSystem::onDisk(const std::string& path) const { return root_ + path; }
+std::string LinuxFileSystem::onDisk(const std::string& path) const {
+  return root_ + path;
+}
 
 bool LinuxFileSystem::fileExists(const std::string& path) const {
   struct stat info {};

@@ -7,6 +7,7 @@ LinuxPlatform::LinuxPlatform(const std::string& root, const std::string& runtime
       preferences_(PreferencesFileStore::pathFor(root, "com.zorvane.typhorad")),
       fileSystem_(root),
       fontManager_(root),
-      bundle_{ipc_, preferences_, fileSystem_, fontManager_, Clock::system(), SerialQueue::main()} {}
+      bundle_{ipc_, preferences_, fileSystem_, fontManager_, Clock::system(), SerialQueue::main()} {
+}
 
 }  // namespace typhora

@@ -10,9 +10,12 @@ LinuxUserFontManager::LinuxUserFontManager(std::string root) : root_(std::move(r
 
 void LinuxUserFontManager::reset() {
   std::error_code ec;
-  for (const char* dir : {"/var/mobile/Library/UserFonts/FontFiles", "/var/mobile/Library/UserFonts/FontAssets"}) {
+  for (const char* dir :
+       {"/var/mobile/Library/UserFonts/FontFiles", "/var/mobile/Library/UserFonts/FontAssets"}) {
     std::filesystem::create_directories(root_ + dir, ec);
-    if (ec) TYLog_Error(kTYLogTyphoraDaemon, "font registry: cannot create %@: %@", root_ + dir, ec.message());
+    if (ec)
+      TYLog_Error(kTYLogTyphoraDaemon, "font registry: cannot create %@: %@", root_ + dir,
+                  ec.message());
   }
 }
 

@@ -12,6 +12,7 @@
 #include "platform/linux/lumo_endpoint.h"
 #include "platform/linux/lumo_event_loop.h"
 #include "platform/linux/process_identity.h"
+#include "platform/linux/scm_rights.h"
 #include "platform/log.h"
 
 namespace typhora {
@@ -39,10 +40,12 @@ namespace {
 constexpr const char* kLumoError = "lumo error: %s - %@";
 constexpr std::size_t kReadChunk = 64 * 1024;
 
-void setNonBlocking(int fd) { fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK); }
+void setNonBlocking(int fd) {
+  fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK);
+}
 
-void finish(const std::shared_ptr<LumoConnection::Pending>& p, std::optional<std::vector<Value>> reply,
-            std::string error) {
+void finish(const std::shared_ptr<LumoConnection::Pending>& p,
+            std::optional<std::vector<Value>> reply, std::string error) {
   std::lock_guard lock(p->mutex);
   p->reply = std::move(reply);
   p->error = std::move(error);
@@ -53,7 +56,9 @@ void finish(const std::shared_ptr<LumoConnection::Pending>& p, std::optional<std
 class LumoProxy final : public IpcRemoteProxy {
  public:
   LumoProxy(std::weak_ptr<LumoConnection> connection, IpcErrorHandler onError, bool synchronous)
-      : connection_(std::move(connection)), onError_(std::move(onError)), synchronous_(synchronous) {}
+      : connection_(std::move(connection)),
+        onError_(std::move(onError)),
+        synchronous_(synchronous) {}
 
   void call(const std::string& wireName, std::vector<Value> arguments, IpcReply onReply) override {
     auto connection = connection_.lock();
@@ -143,20 +148,14 @@ bool LumoConnection::connectNow(std::string* error) {
     UniqueFd theirs(pair[1]);
     char byte = 'c';
     iovec iov{&byte, 1};
-    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
     msghdr msg{};
     msg.msg_iov = &iov;
     msg.msg_iovlen = 1;
-    msg.msg_control = control;
-    msg.msg_controllen = sizeof control;
-    cmsghdr* cmsg = CMSG_FIRSTHDR(&msg);
-    cmsg->cmsg_level = SOL_SOCKET;
-    cmsg->cmsg_type = SCM_RIGHTS;
-    cmsg->cmsg_len = CMSG_LEN(sizeof(int));
-    int passed = theirs.get();
-    std::memcpy(CMSG_DATA(cmsg), &passed, sizeof passed);
+    std::vector<char> control;
+    attachDescriptors(&msg, &control, {theirs.get()});
     if (sendmsg(lumo->fd(), &msg, MSG_NOSIGNAL | MSG_DONTWAIT) != 1) {
-      return *error = std::string("the endpoint's listener is gone: ") + std::strerror(errno), false;
+      return *error = std::string("the endpoint's listener is gone: ") + std::strerror(errno),
+             false;
     }
     fd_ = std::move(ours);
   } else {
@@ -195,7 +194,9 @@ void LumoConnection::resume() {
   end(error, false);
 }
 
-void LumoConnection::invalidate() { end("invalidated", false); }
+void LumoConnection::invalidate() {
+  end("invalidated", false);
+}
 
 void LumoConnection::onEvents(std::uint32_t events) {
   std::string error;
@@ -233,15 +234,7 @@ bool LumoConnection::readAvailable(std::string* error) {
       *error = n == 0 ? "the peer closed the connection" : std::strerror(errno);
       return false;
     }
-    for (cmsghdr* c = CMSG_FIRSTHDR(&msg); c != nullptr; c = CMSG_NXTHDR(&msg, c)) {
-      if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) continue;
-      std::size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-      for (std::size_t i = 0; i < count; ++i) {
-        int fd;
-        std::memcpy(&fd, CMSG_DATA(c) + i * sizeof(int), sizeof fd);
-        decoder_.addDescriptor(UniqueFd(fd));
-      }
-    }
+    for (UniqueFd& fd : takeDescriptors(&msg)) decoder_.addDescriptor(std::move(fd));
     if ((msg.msg_flags & MSG_CTRUNC) != 0) {
       *error = "too many descriptors in one message";
       SystemLog(kLumoError, "-[LumoConnection read]", *error);
@@ -281,13 +274,15 @@ void LumoConnection::handleInvoke(const LumoMessage& message) {
     object = exportedObject_;
   }
   const IpcOperation* op = interface ? interface->find(message.text) : nullptr;
-  if (op == nullptr || object == nullptr) return refuse(message, "unknown operation " + message.text);
+  if (op == nullptr || object == nullptr)
+    return refuse(message, "unknown operation " + message.text);
   std::string why;
   if (!IpcInterface::matches(*op, message.values, &why)) return refuse(message, why);
 
   IpcReply reply;
   if (op->replies && message.id != 0) {
-    std::weak_ptr<LumoConnection> weak = std::static_pointer_cast<LumoConnection>(shared_from_this());
+    std::weak_ptr<LumoConnection> weak =
+        std::static_pointer_cast<LumoConnection>(shared_from_this());
     auto once = std::make_shared<std::once_flag>();
     reply = [weak, once, id = message.id](std::vector<Value> values) {
       std::call_once(*once, [&] {
@@ -380,18 +375,10 @@ bool LumoConnection::flushLocked(std::string* error) {
     msg.msg_iov = &iov;
     msg.msg_iovlen = 1;
     std::vector<char> control;
-    if (front.offset == 0 && !front.fds.empty()) {
-      control.resize(CMSG_SPACE(sizeof(int) * front.fds.size()));
-      msg.msg_control = control.data();
-      msg.msg_controllen = control.size();
-      cmsghdr* cmsg = CMSG_FIRSTHDR(&msg);
-      cmsg->cmsg_level = SOL_SOCKET;
-      cmsg->cmsg_type = SCM_RIGHTS;
-      cmsg->cmsg_len = CMSG_LEN(sizeof(int) * front.fds.size());
-      for (std::size_t i = 0; i < front.fds.size(); ++i) {
-        int fd = front.fds[i].get();
-        std::memcpy(CMSG_DATA(cmsg) + i * sizeof(int), &fd, sizeof fd);
-      }
+    if (front.offset == 0) {
+      std::vector<int> fds;
+      for (const UniqueFd& fd : front.fds) fds.push_back(fd.get());
+      attachDescriptors(&msg, &control, fds);
     }
     ssize_t n = sendmsg(fd_.get(), &msg, MSG_NOSIGNAL | MSG_DONTWAIT);
     if (n < 0 && errno == EINTR) continue;
@@ -445,7 +432,8 @@ void LumoConnection::call(const std::string& wireName, std::vector<Value> argume
       pending_[id] = pending;
     }
   }
-  if (why.empty() && !send(LumoMessage{LumoMessage::Kind::Invoke, id, wireName, std::move(arguments)}, &why)) {
+  if (why.empty() &&
+      !send(LumoMessage{LumoMessage::Kind::Invoke, id, wireName, std::move(arguments)}, &why)) {
     std::lock_guard lock(mutex_);
     pending_.erase(id);
   }

@@ -46,7 +46,8 @@ class LumoConnection final : public IpcConnection {
   void invalidate() override;
   bool isValid() const override;
   std::shared_ptr<IpcRemoteProxy> remoteObjectProxy(IpcErrorHandler errorHandler) override;
-  std::shared_ptr<IpcRemoteProxy> synchronousRemoteObjectProxy(IpcErrorHandler errorHandler) override;
+  std::shared_ptr<IpcRemoteProxy> synchronousRemoteObjectProxy(
+      IpcErrorHandler errorHandler) override;
   AuditToken auditToken() const override;
 
   // Sends a call of the remote interface (used by the proxies).

@@ -11,7 +11,9 @@ class LumoEndpoint final : public IpcEndpoint {
  public:
   explicit LumoEndpoint(UniqueFd fd) : fd_(std::move(fd)) {}
   int fd() const { return fd_.get(); }
-  std::string description() const override { return "<lumo endpoint fd " + std::to_string(fd_.get()) + ">"; }
+  std::string description() const override {
+    return "<lumo endpoint fd " + std::to_string(fd_.get()) + ">";
+  }
 
  private:
   UniqueFd fd_;

@@ -23,7 +23,8 @@ bool encodeLumoFrame(const LumoMessage& message, std::vector<std::uint8_t>* fram
                      const std::function<int(const std::shared_ptr<const IpcEndpoint>&)>& fdOf,
                      std::string* error, const LumoLimits& limits) {
   EndpointHooks hooks;
-  hooks.toIndex = [&](const std::shared_ptr<const IpcEndpoint>& ep) -> std::optional<std::uint64_t> {
+  hooks.toIndex =
+      [&](const std::shared_ptr<const IpcEndpoint>& ep) -> std::optional<std::uint64_t> {
     int fd = fdOf ? fdOf(ep) : -1;
     if (fd < 0 || fds->size() >= limits.maxDescriptors) return std::nullopt;
     fds->push_back(fd);
@@ -87,8 +88,10 @@ LumoFrameDecoder::Status LumoFrameDecoder::next(
   }
   if (!decoded) return malformed("undecodable message: " + why);
   const ValueArray* parts = decoded->asArray();
-  std::optional<std::int64_t> kind = parts && parts->size() == 4 ? (*parts)[0].asInt() : std::nullopt;
-  std::optional<std::uint64_t> id = parts && parts->size() == 4 ? (*parts)[1].asUInt() : std::nullopt;
+  std::optional<std::int64_t> kind =
+      parts && parts->size() == 4 ? (*parts)[0].asInt() : std::nullopt;
+  std::optional<std::uint64_t> id =
+      parts && parts->size() == 4 ? (*parts)[1].asUInt() : std::nullopt;
   const std::string* text = parts && parts->size() == 4 ? (*parts)[2].asString() : nullptr;
   const ValueArray* values = parts && parts->size() == 4 ? (*parts)[3].asArray() : nullptr;
   if (!kind || *kind < 0 || *kind > 2 || !id || text == nullptr || values == nullptr) {

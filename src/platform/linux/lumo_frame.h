@@ -20,8 +20,8 @@ namespace typhora {
 struct LumoMessage {
   enum class Kind : std::uint8_t { Invoke = 0, Reply = 1, Error = 2 };
   Kind kind = Kind::Invoke;
-  std::uint64_t id = 0;      // the reply id; 0 for a one-way invocation
-  std::string text;          // the wire name (Invoke) or the error (Error)
+  std::uint64_t id = 0;       // the reply id; 0 for a one-way invocation
+  std::string text;           // the wire name (Invoke) or the error (Error)
   std::vector<Value> values;  // arguments or reply values
 };
 
@@ -39,7 +39,9 @@ class LumoFrameDecoder {
  public:
   explicit LumoFrameDecoder(LumoLimits limits = {}) : limits_(limits) {}
 
-  void addBytes(std::span<const std::uint8_t> bytes) { buffer_.insert(buffer_.end(), bytes.begin(), bytes.end()); }
+  void addBytes(std::span<const std::uint8_t> bytes) {
+    buffer_.insert(buffer_.end(), bytes.begin(), bytes.end());
+  }
   void addDescriptor(UniqueFd fd) { descriptors_.push_back(std::move(fd)); }
 
   enum class Status { Message, NeedMore, Malformed };

@@ -10,6 +10,7 @@
 #include "platform/linux/lumo_connection.h"
 #include "platform/linux/lumo_endpoint.h"
 #include "platform/linux/lumo_event_loop.h"
+#include "platform/linux/scm_rights.h"
 #include "platform/log.h"
 
 namespace typhora {
@@ -82,16 +83,7 @@ void LumoListener::onReadable() {
     ssize_t n = recvmsg(fd_.get(), &msg, MSG_CMSG_CLOEXEC | MSG_DONTWAIT);
     if (n < 0 && errno == EINTR) continue;
     if (n <= 0) return;
-    std::vector<UniqueFd> received;
-    for (cmsghdr* c = CMSG_FIRSTHDR(&msg); c != nullptr; c = CMSG_NXTHDR(&msg, c)) {
-      if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_RIGHTS) continue;
-      std::size_t count = (c->cmsg_len - CMSG_LEN(0)) / sizeof(int);
-      for (std::size_t i = 0; i < count; ++i) {
-        int fd;
-        std::memcpy(&fd, CMSG_DATA(c) + i * sizeof(int), sizeof fd);
-        received.emplace_back(fd);
-      }
-    }
+    std::vector<UniqueFd> received = takeDescriptors(&msg);
     // Exactly one socket per request; anything else is refused and closed.
     if (received.size() == 1) offer(std::move(received[0]));
   }

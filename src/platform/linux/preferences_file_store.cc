@@ -86,7 +86,8 @@ bool PreferencesFileStore::synchronize() {
     UniqueFd dir(open(target.parent_path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (dir.valid()) fsync(dir.get());
   } else {
-    TYLog_Error(kTYLogTyphoraDaemon, "cannot write preferences %@: %@", path_, std::strerror(errno));
+    TYLog_Error(kTYLogTyphoraDaemon, "cannot write preferences %@: %@", path_,
+                std::strerror(errno));
     unlink(temporary.c_str());
   }
   return ok;

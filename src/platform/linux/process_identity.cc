@@ -71,8 +71,8 @@ bool ProcessIdentity::isValid(const AuditToken& token) {
 std::optional<std::string> ProcessIdentity::executablePath(const AuditToken& token) {
   if (!isValid(token)) return std::nullopt;
   char buffer[4096];
-  ssize_t n = readlink(("/proc/" + std::to_string(token.pid) + "/exe").c_str(), buffer,
-                       sizeof buffer - 1);
+  ssize_t n =
+      readlink(("/proc/" + std::to_string(token.pid) + "/exe").c_str(), buffer, sizeof buffer - 1);
   if (n <= 0 || !isValid(token)) return std::nullopt;
   return std::string(buffer, static_cast<std::size_t>(n));
 }
