@@ -97,5 +97,7 @@ int main(int argc, char** argv) {
   typhora::TyphoraDaemon::installPlatform(platform.bundle());
   typhora::TyphoraDaemon& daemon = typhora::TyphoraDaemon::sharedDaemon();
   daemon.startUp();
+  typhora::SystemLog("typhorad ready: device root %s, runtime directory %s", options.root,
+                     options.runtimeDir);
   daemon.run();
 }
