@@ -78,10 +78,10 @@ class JournalSink final : public LogSink {
   }
 };
 
-// Appends the conversion at `spec` (one letter, after any length modifiers) for `arg`.
-void appendConversion(std::string* out, char spec, const LogArg& arg) {
+// Appends one conversion (its letter, after any length modifiers) for `arg`.
+void appendConversion(std::string* out, char conversion, const LogArg& arg) {
   const auto& v = arg.value();
-  if (spec == '@' || spec == 's') {
+  if (conversion == '@' || conversion == 's') {
     if (auto* s = std::get_if<std::string>(&v)) {
       *out += *s;
     } else if (auto* i = std::get_if<std::int64_t>(&v)) {
@@ -98,7 +98,7 @@ void appendConversion(std::string* out, char spec, const LogArg& arg) {
   } else if (auto* u = std::get_if<std::uint64_t>(&v)) {
     *out += std::to_string(*u);
   } else if (auto* d = std::get_if<double>(&v)) {
-    *out += spec == 'f' ? std::to_string(*d) : std::to_string(static_cast<std::int64_t>(*d));
+    *out += conversion == 'f' ? std::to_string(*d) : std::to_string(static_cast<std::int64_t>(*d));
   } else {
     *out += std::get<std::string>(v);
   }
@@ -127,8 +127,8 @@ std::string formatLog(std::string_view format, std::initializer_list<LogArg> arg
       out += format.substr(i);
       break;
     }
-    char spec = format[j];
-    if (spec != '@' && spec != 's' && spec != 'd' && spec != 'i' && spec != 'u' && spec != 'f') {
+    char conversion = format[j];
+    if (conversion != '@' && conversion != 's' && conversion != 'd' && conversion != 'i' && conversion != 'u' && conversion != 'f') {
       out += format.substr(i, j - i + 1);  // unknown conversions stay as written
       i = j;
       continue;
@@ -136,7 +136,7 @@ std::string formatLog(std::string_view format, std::initializer_list<LogArg> arg
     if (next == args.end()) {
       out += "(missing)";
     } else {
-      appendConversion(&out, spec, *next++);
+      appendConversion(&out, conversion, *next++);
     }
     i = j;
   }
