@@ -163,6 +163,7 @@ class Builder {
       : limits_(limits), hooks_(hooks) {}
 
   bool failed() const { return !error_.empty(); }
+  void setInputLeft(std::size_t bytes) { inputLeft_ = bytes; }
   const std::string& error() const { return error_; }
   bool complete() const { return done_ && stack_.empty(); }
   Value take() { return std::move(result_); }
@@ -220,6 +221,13 @@ class Builder {
       frame.remaining = *count * 2;
     }
     if (!frame.indefinite && frame.remaining > limits_.maxItems) return fail("too many items");
+    // Reserve what a definite container declares, but never more than the unread input could
+    // hold: a declared length alone must not make the decoder allocate.
+    if (!frame.indefinite && count) {
+      const std::size_t plausible = std::min(*count, inputLeft_);
+      if (kind == Frame::Kind::Array) frame.items.reserve(plausible);
+      if (kind == Frame::Kind::Map) frame.entries.reserve(plausible);
+    }
     const bool empty = !frame.indefinite && frame.remaining == 0;
     if (kind == Frame::Kind::DateTag || kind == Frame::Kind::EndpointTag) frame.remaining = 1;
     stack_.push_back(std::move(frame));
@@ -302,6 +310,7 @@ class Builder {
 
   const DecodeLimits& limits_;
   const EndpointHooks* hooks_;
+  std::size_t inputLeft_ = 0;
   std::vector<Frame> stack_;
   std::size_t items_ = 0;
   bool done_ = false;
@@ -375,6 +384,7 @@ std::optional<Value> CborCodec::decode(std::span<const std::uint8_t> input,
   Builder builder(limits, hooks);
   std::size_t offset = 0;
   while (offset < input.size() && !builder.failed() && !builder.complete()) {
+    builder.setInputLeft(input.size() - offset);
     cbor_decoder_result r =
         cbor_stream_decode(input.data() + offset, input.size() - offset, &callbacks(), &builder);
     if (r.status == CBOR_DECODER_NEDATA) {
