@@ -4,6 +4,7 @@
 
 #include <optional>
 #include <string>
+#include <vector>
 
 #include "platform/value.h"
 
@@ -16,6 +17,13 @@ class FileSystem {
   // One property list (CBOR or JSON) read from the file; nullopt with `error` set on failure.
   virtual std::optional<Value> readPropertyList(const std::string& path,
                                                 std::string* error) const = 0;
+  // Removes the file or directory at `path`, with everything below a directory; false with
+  // `error` set when it could not.
+  virtual bool removeItem(const std::string& path, std::string* error) = 0;
+  // The names of the entries of directory `path`, in no set order; nullopt when it cannot be
+  // listed.
+  virtual std::optional<std::vector<std::string>> contentsOfDirectory(
+      const std::string& path) const = 0;
 };
 
 }  // namespace typhora

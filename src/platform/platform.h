@@ -1,10 +1,16 @@
 // Everything the daemon reaches the platform through, handed to it at construction.
 #pragma once
 
+#include "platform/analytics_sink.h"
+#include "platform/app_registry.h"
+#include "platform/app_state_monitor.h"
+#include "platform/build_variant.h"
 #include "platform/clock.h"
+#include "platform/code_signing_query.h"
 #include "platform/file_system.h"
 #include "platform/ipc_listener.h"
 #include "platform/preferences_store.h"
+#include "platform/sandbox_broker.h"
 #include "platform/serial_queue.h"
 #include "platform/ty_user_font_manager.h"
 
@@ -15,6 +21,12 @@ struct Platform {
   PreferencesStore& preferences;
   FileSystem& fileSystem;
   TYUserFontManager& fontManager;
+  CodeSigningQuery& codeSigning;
+  SandboxBroker& sandbox;
+  AppRegistry& appRegistry;
+  AppStateMonitor& appStates;
+  AnalyticsSink& analytics;
+  BuildVariant& buildVariant;
   Clock& clock;
   SerialQueue& mainQueue;
 };

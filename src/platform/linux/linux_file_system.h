@@ -4,6 +4,7 @@
 #include <string>
 
 #include "platform/file_system.h"
+#include "platform/linux/device_root.h"
 
 namespace typhora {
 
@@ -12,11 +13,14 @@ class LinuxFileSystem final : public FileSystem {
   explicit LinuxFileSystem(std::string root);
   bool fileExists(const std::string& path) const override;
   std::optional<Value> readPropertyList(const std::string& path, std::string* error) const override;
+  bool removeItem(const std::string& path, std::string* error) override;
+  std::optional<std::vector<std::string>> contentsOfDirectory(
+      const std::string& path) const override;
   // The machine's path of one of the daemon's paths.
   std::string onDisk(const std::string& path) const;
 
  private:
-  std::string root_;  // without a trailing "/"; empty for "/"
+  DeviceRoot root_;
 };
 
 }  // namespace typhora

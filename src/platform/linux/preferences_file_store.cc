@@ -1,32 +1,13 @@
 #include "platform/linux/preferences_file_store.h"
 
-#include <fcntl.h>
-#include <unistd.h>
-
-#include <cerrno>
-#include <cstring>
 #include <filesystem>
 
 #include "platform/cbor_codec.h"
-#include "platform/linux/unique_fd.h"
+#include "platform/linux/atomic_file.h"
 #include "platform/log.h"
 #include "platform/plist_reader.h"
 
 namespace typhora {
-namespace {
-
-bool writeAll(int fd, const Bytes& bytes) {
-  std::size_t done = 0;
-  while (done < bytes.size()) {
-    ssize_t n = write(fd, bytes.data() + done, bytes.size() - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return false;
-    done += static_cast<std::size_t>(n);
-  }
-  return true;
-}
-
-}  // namespace
 
 PreferencesFileStore::PreferencesFileStore(std::string path) : path_(std::move(path)) {}
 
@@ -74,22 +55,9 @@ bool PreferencesFileStore::synchronize() {
   std::vector<DictionaryEntry> entries(values_->begin(), values_->end());
   Bytes bytes = CborCodec::encode(Value(Dictionary(std::move(entries))));
 
-  const std::filesystem::path target(path_);
-  std::error_code ec;
-  std::filesystem::create_directories(target.parent_path(), ec);
-  const std::string temporary = path_ + ".tmp-" + std::to_string(getpid());
-  UniqueFd fd(open(temporary.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600));
-  bool ok = fd.valid() && writeAll(fd.get(), bytes) && fsync(fd.get()) == 0;
-  fd.reset();
-  ok = ok && rename(temporary.c_str(), path_.c_str()) == 0;
-  if (ok) {
-    UniqueFd dir(open(target.parent_path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (dir.valid()) fsync(dir.get());
-  } else {
-    TYLog_Error(kTYLogTyphoraDaemon, "cannot write preferences %@: %@", path_,
-                std::strerror(errno));
-    unlink(temporary.c_str());
-  }
+  std::string error;
+  bool ok = AtomicFile::write(path_, bytes, 0600, &error);
+  if (!ok) TYLog_Error(kTYLogTyphoraDaemon, "cannot write preferences %@: %@", path_, error);
   return ok;
 }
 
