@@ -6,7 +6,7 @@ packages=(
   g++ clang libclang-rt-14-dev cmake ninja-build pkg-config git
   libcbor-dev libsodium-dev libsimdjson-dev libsystemd-dev libfreetype-dev
   libgtest-dev libgmock-dev libbenchmark-dev
-  systemd procps
+  systemd procps fonts-dejavu-core
 )
 
 missing=()

@@ -6,21 +6,24 @@
 #include <string>
 #include <vector>
 
+#include "app_state_command.h"
 #include "client_command.h"
 #include "plist_command.h"
 
 namespace {
 
 constexpr const char* kUsage =
-    "usage: typhoractl [--runtime-dir DIR] COMMAND [ARGS...]\n"
+    "usage: typhoractl [--runtime-dir DIR] [--root DIR] COMMAND [ARGS...]\n"
     "\n"
     "commands:\n"
     "  updating-user-fonts   wait for the daemon's pending user-fonts updates\n"
     "  call OPERATION ...    call any operation of the service, print the reply as JSON\n"
     "  plist show|convert    show or convert property-list files (CBOR or JSON)\n"
+    "  app-state set|clear|show   the platform's record of application states\n"
     "\n"
     "  --runtime-dir DIR     where the daemon's socket is (default $TYPHORA_RUNTIME_DIR,\n"
     "                        else /run/typhora)\n"
+    "  --root DIR            the device root (default $TYPHORA_ROOT, else /)\n"
     "Each command takes --help.\n";
 
 }  // namespace
@@ -31,6 +34,8 @@ int main(int argc, char** argv) {
   typhora::ctl::ClientOptions options;
   const char* fromEnv = std::getenv("TYPHORA_RUNTIME_DIR");
   options.runtimeDir = fromEnv != nullptr ? fromEnv : "/run/typhora";
+  const char* rootFromEnv = std::getenv("TYPHORA_ROOT");
+  std::string root = rootFromEnv != nullptr ? rootFromEnv : "/";
 
   while (!args.empty() && args[0].starts_with("--")) {
     if (args[0] == "--help" || args[0] == "-h") {
@@ -42,6 +47,11 @@ int main(int argc, char** argv) {
       args.erase(args.begin(), args.begin() + 2);
       continue;
     }
+    if (args[0] == "--root" && args.size() >= 2) {
+      root = args[1];
+      args.erase(args.begin(), args.begin() + 2);
+      continue;
+    }
     std::cerr << "typhoractl: unknown option " << args[0] << "\n" << kUsage;
     return 2;
   }
@@ -50,5 +60,7 @@ int main(int argc, char** argv) {
     return 2;
   }
   if (args[0] == "plist") return typhora::ctl::runPlistCommand({args.begin() + 1, args.end()});
+  if (args[0] == "app-state")
+    return typhora::ctl::runAppStateCommand(root, {args.begin() + 1, args.end()});
   return typhora::ctl::runClientCommand(options, args);
 }
