@@ -19,11 +19,9 @@ constexpr const char* kUsage =
     "platform's table under the device root, or removes it. `show` prints the state the daemon\n"
     "would see: {\"pid\": PID, \"state\": STATE}.\n";
 
-std::optional<int> number(const std::string& text) {
-  int value = 0;
-  auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), value);
-  if (error != std::errc() || end != text.data() + text.size()) return std::nullopt;
-  return value;
+bool parseNumber(const std::string& text, int* value) {
+  auto [end, error] = std::from_chars(text.data(), text.data() + text.size(), *value);
+  return error == std::errc() && end == text.data() + text.size();
 }
 
 }  // namespace
@@ -33,18 +31,20 @@ int runAppStateCommand(const std::string& root, const std::vector<std::string>& 
     std::cout << kUsage;
     return args.empty() ? 2 : 0;
   }
-  std::optional<int> pid = args.size() >= 2 ? number(args[1]) : std::nullopt;
-  std::optional<int> state = args.size() == 3 ? number(args[2]) : std::nullopt;
+  int pid = 0;
+  int state = 0;
+  bool hasPid = args.size() >= 2 && parseNumber(args[1], &pid);
+  bool hasState = args.size() == 3 && parseNumber(args[2], &state);
   LinuxAppStateMonitor states(root);
   std::string error;
   bool ok = false;
-  if (args[0] == "set" && pid && state) {
-    ok = states.setState(*pid, *state, &error);
-  } else if (args[0] == "clear" && pid && args.size() == 2) {
-    ok = states.setState(*pid, std::nullopt, &error);
-  } else if (args[0] == "show" && pid && args.size() == 2) {
-    std::cout << "{\"pid\": " << *pid
-              << ", \"state\": " << states.mostElevatedApplicationState(*pid) << "}\n";
+  if (args[0] == "set" && hasPid && hasState) {
+    ok = states.setState(pid, state, &error);
+  } else if (args[0] == "clear" && hasPid && args.size() == 2) {
+    ok = states.setState(pid, std::nullopt, &error);
+  } else if (args[0] == "show" && hasPid && args.size() == 2) {
+    std::cout << "{\"pid\": " << pid << ", \"state\": " << states.mostElevatedApplicationState(pid)
+              << "}\n";
     return 0;
   } else {
     std::cerr << kUsage;
