@@ -46,10 +46,14 @@ void TyphoraDaemon::invalidateUserFonts() {
   userFontsInfo_ = Value();
 }
 
+std::string TyphoraDaemon::userFontsFilePath() {
+  return formatLog(kMobileHomeFormat, {kUserFontsFile});
+}
+
 Value TyphoraDaemon::_userFontsInfoFromDisk() {
   Value slot;
   updatingUserFonts([this, &slot] {
-    const std::string path = formatLog(kMobileHomeFormat, {kUserFontsFile});
+    const std::string path = userFontsFilePath();
     if (!platform_.fileSystem.fileExists(path)) return;
     std::string error;
     std::optional<Value> read = platform_.fileSystem.readPropertyList(path, &error);

@@ -1,13 +1,17 @@
 // typhorad: the font access daemon. Builds the Linux platform, starts the daemon in its fixed
 // order and hands the main thread to the main queue for good.
 #include <unistd.h>
+#include <algorithm>
 #include <csignal>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <string>
 
 #include "daemon/typhora_daemon.h"
+#include "platform/linux/device_root.h"
+#include "platform/linux/heap_reserve.h"
 #include "platform/linux/linux_platform.h"
 #include "platform/log.h"
 
@@ -83,10 +87,20 @@ Options parseOptions(int argc, char** argv) {
   return options;
 }
 
+// The heap that decoding the user-fonts file at start-up will fill, about four times the file.
+std::size_t startUpHeapBytes(const std::string& root) {
+  constexpr std::uintmax_t kMaxBytes = 256u << 20;
+  std::error_code ec;
+  std::uintmax_t size = std::filesystem::file_size(
+      typhora::DeviceRoot(root).onDisk(typhora::TyphoraDaemon::userFontsFilePath()), ec);
+  return ec ? 0 : static_cast<std::size_t>(std::min(4 * size, kMaxBytes));
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
   const Options options = parseOptions(argc, argv);
+  typhora::HeapReserve::prefault(startUpHeapBytes(options.root));
   std::signal(SIGPIPE, SIG_IGN);
   typhora::setLogLevel(options.level);
   typhora::setLogSink(options.target == "journal" ? typhora::makeJournalLogSink()

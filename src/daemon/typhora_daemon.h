@@ -79,6 +79,8 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   void invalidateUserFonts();
   // Reads the user-fonts file on the update queue: the dictionary, or null.
   Value _userFontsInfoFromDisk();
+  // The daemon's path of the user-fonts file.
+  static std::string userFontsFilePath();
 
   // --- Access control (access/) ---
 
