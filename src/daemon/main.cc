@@ -109,6 +109,8 @@ int main(int argc, char** argv) {
   // The platform lives as long as the process: nothing is freed at shutdown.
   static typhora::LinuxPlatform platform(options.root, options.runtimeDir);
   typhora::TyphoraDaemon::installPlatform(platform.bundle());
+  // Events posted before the daemon installs its handlers wait in their streams.
+  platform.startServices();
   typhora::TyphoraDaemon& daemon = typhora::TyphoraDaemon::sharedDaemon();
   daemon.startUp();
   typhora::SystemLog("typhorad ready: device root %s, runtime directory %s", options.root,

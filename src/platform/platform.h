@@ -4,14 +4,20 @@
 #include "platform/analytics_sink.h"
 #include "platform/app_registry.h"
 #include "platform/app_state_monitor.h"
+#include "platform/asset_catalog.h"
 #include "platform/build_variant.h"
 #include "platform/clock.h"
 #include "platform/code_signing_query.h"
+#include "platform/file_event_stream.h"
 #include "platform/file_system.h"
 #include "platform/ipc_listener.h"
+#include "platform/launch_event_stream.h"
 #include "platform/preferences_store.h"
+#include "platform/remote_alert.h"
 #include "platform/sandbox_broker.h"
+#include "platform/scheduled_activity.h"
 #include "platform/serial_queue.h"
+#include "platform/system_notify.h"
 #include "platform/ty_user_font_manager.h"
 
 namespace typhora {
@@ -27,6 +33,12 @@ struct Platform {
   AppStateMonitor& appStates;
   AnalyticsSink& analytics;
   BuildVariant& buildVariant;
+  LaunchEventStream& launchEvents;
+  ScheduledActivity& activities;
+  AssetCatalog& assetCatalog;
+  SystemNotify& systemNotify;
+  FileEventStreamFactory& fileEvents;
+  RemoteAlert& remoteAlert;
   Clock& clock;
   SerialQueue& mainQueue;
 };

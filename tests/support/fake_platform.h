@@ -41,8 +41,9 @@ struct FakePlatform {
   FakeBuildVariant buildVariant;
   ManualClock clock;
   std::shared_ptr<SerialQueue> mainQueue = SerialQueue::createManual("test.main-queue", &clock);
-  Platform platform{ipc,         preferences, fileSystem, fontManager,  codeSigning, sandbox,
-                    appRegistry, appStates,   analytics,  buildVariant, clock,       *mainQueue};
+  Platform platform{ipc,          preferences,  fileSystem, fontManager,  codeSigning,  sandbox,
+                    appRegistry,  appStates,    analytics,  buildVariant, launchEvents, activities,
+                    assetCatalog, systemNotify, fileEvents, remoteAlert,  clock,        *mainQueue};
 };
 
 }  // namespace typhora::testing

@@ -8,7 +8,9 @@
 
 #include "app_state_command.h"
 #include "client_command.h"
+#include "event_command.h"
 #include "plist_command.h"
+#include "view_service_command.h"
 
 namespace {
 
@@ -20,6 +22,9 @@ constexpr const char* kUsage =
     "  call OPERATION ...    call any operation of the service, print the reply as JSON\n"
     "  plist show|convert    show or convert property-list files (CBOR or JSON)\n"
     "  app-state set|clear|show   the platform's record of application states\n"
+    "  event post|watch      post or watch notifications on the daemon's event socket\n"
+    "  activity run ID       run one of the daemon's background activities now\n"
+    "  view-service          play the font-install view service an alert starts\n"
     "\n"
     "  --runtime-dir DIR     where the daemon's socket is (default $TYPHORA_RUNTIME_DIR,\n"
     "                        else /run/typhora)\n"
@@ -59,8 +64,14 @@ int main(int argc, char** argv) {
     std::cerr << kUsage;
     return 2;
   }
+  if (args[0] == "view-service")
+    return typhora::ctl::runViewServiceCommand({args.begin() + 1, args.end()});
   if (args[0] == "plist") return typhora::ctl::runPlistCommand({args.begin() + 1, args.end()});
   if (args[0] == "app-state")
     return typhora::ctl::runAppStateCommand(root, {args.begin() + 1, args.end()});
+  if (args[0] == "event")
+    return typhora::ctl::runEventCommand(options, {args.begin() + 1, args.end()});
+  if (args[0] == "activity")
+    return typhora::ctl::runActivityCommand(options, {args.begin() + 1, args.end()});
   return typhora::ctl::runClientCommand(options, args);
 }

@@ -14,8 +14,24 @@ LinuxPlatform::LinuxPlatform(const std::string& root, const std::string& runtime
       appStates_(root),
       analytics_(root, Clock::system()),
       buildVariant_(root),
-      bundle_{ipc_,         preferences_,  fileSystem_,     fontManager_,
-              codeSigning_, sandbox_,      appRegistry_,    appStates_,
-              analytics_,   buildVariant_, Clock::system(), SerialQueue::main()} {}
+      launchConfiguration_(root),
+      launchEvents_(launchConfiguration_),
+      eventHub_(std::make_shared<LinuxEventHub>(ipc_, launchEvents_)),
+      systemNotify_(*eventHub_),
+      activities_(launchConfiguration_, SerialQueue::main()),
+      assetCatalog_(root, systemNotify_),
+      fileEvents_(root),
+      remoteAlert_(root),
+      bundle_{ipc_,          preferences_,    fileSystem_,        fontManager_,  codeSigning_,
+              sandbox_,      appRegistry_,    appStates_,         analytics_,    buildVariant_,
+              launchEvents_, activities_,     assetCatalog_,      systemNotify_, fileEvents_,
+              remoteAlert_,  Clock::system(), SerialQueue::main()} {
+  eventHub_->setActivityRunner(
+      [this](const std::string& identifier) { return activities_.runNow(identifier); });
+}
+
+bool LinuxPlatform::startServices() {
+  return eventHub_->start();
+}
 
 }  // namespace typhora

@@ -1,16 +1,25 @@
 // The real platform on Linux, every path under one device root.
 #pragma once
 
+#include <memory>
 #include <string>
 
 #include "platform/linux/app_manifest_store.h"
+#include "platform/linux/launch_configuration.h"
 #include "platform/linux/linux_analytics_sink.h"
 #include "platform/linux/linux_app_registry.h"
 #include "platform/linux/linux_app_state_monitor.h"
+#include "platform/linux/linux_asset_catalog.h"
 #include "platform/linux/linux_build_variant.h"
 #include "platform/linux/linux_code_signing_query.h"
+#include "platform/linux/linux_event_hub.h"
+#include "platform/linux/linux_file_event_stream.h"
 #include "platform/linux/linux_file_system.h"
+#include "platform/linux/linux_launch_event_stream.h"
+#include "platform/linux/linux_remote_alert.h"
 #include "platform/linux/linux_sandbox_broker.h"
+#include "platform/linux/linux_scheduled_activity.h"
+#include "platform/linux/linux_system_notify.h"
 #include "platform/linux/linux_user_font_manager.h"
 #include "platform/linux/lumo_service.h"
 #include "platform/linux/preferences_file_store.h"
@@ -22,6 +31,8 @@ class LinuxPlatform {
  public:
   LinuxPlatform(const std::string& root, const std::string& runtimeDir);
   Platform& bundle() { return bundle_; }
+  // Opens the platform's own sockets (the event socket); false when one cannot be opened.
+  bool startServices();
 
  private:
   LumoService ipc_;
@@ -35,6 +46,14 @@ class LinuxPlatform {
   LinuxAppStateMonitor appStates_;
   LinuxAnalyticsSink analytics_;
   LinuxBuildVariant buildVariant_;
+  LaunchConfiguration launchConfiguration_;
+  LinuxLaunchEventStream launchEvents_;
+  std::shared_ptr<LinuxEventHub> eventHub_;
+  LinuxSystemNotify systemNotify_;
+  LinuxScheduledActivity activities_;
+  LinuxAssetCatalog assetCatalog_;
+  LinuxFileEventStreamFactory fileEvents_;
+  LinuxRemoteAlert remoteAlert_;
   Platform bundle_;
 };
 

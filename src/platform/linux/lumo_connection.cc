@@ -479,6 +479,10 @@ void LumoConnection::end(const std::string& reason, bool peerWentAway) {
     invalidation = std::move(invalidationHandler_);
     interruption = std::move(interruptionHandler_);
     object = std::move(exportedObject_);
+    // Closing our side: what the socket still takes goes out first, so a last one-way message
+    // sent just before invalidate() is not lost.
+    std::string ignored;
+    if (!peerWentAway && fd_.valid()) flushLocked(&ignored);
     outbound_.clear();
     outboundBytes_ = 0;
     if (fd_.valid()) {

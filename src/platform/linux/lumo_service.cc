@@ -41,6 +41,11 @@ int activatedSocket(const std::string& name) {
 LumoService::LumoService(std::string runtimeDir) : runtimeDir_(std::move(runtimeDir)) {}
 
 std::shared_ptr<IpcListener> LumoService::makeNamedListener(const std::string& serviceName) {
+  return makeNamedListener(serviceName, 0666);
+}
+
+std::shared_ptr<IpcListener> LumoService::makeNamedListener(const std::string& serviceName,
+                                                            mode_t mode) {
   if (int fd = activatedSocket(serviceName); fd >= 0) {
     // Inherited sockets come blocking; the I/O loop accepts until it would block.
     fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK);
@@ -58,7 +63,7 @@ std::shared_ptr<IpcListener> LumoService::makeNamedListener(const std::string& s
   std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
   unlink(path.c_str());
   if (bind(fd.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
-      chmod(path.c_str(), 0666) != 0 || listen(fd.get(), 1024) != 0) {
+      chmod(path.c_str(), mode) != 0 || listen(fd.get(), 1024) != 0) {
     SystemLog("lumo error: %s - %@", "-[LumoService makeNamedListener]",
               path + ": " + std::strerror(errno));
     return nullptr;
