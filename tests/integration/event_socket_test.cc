@@ -1,0 +1,76 @@
+// The daemon's event socket with real typhoractl peers: posting, watching, activities, and who
+// may connect at all.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include "integration/daemon_test_base.h"
+
+namespace typhora::testing {
+namespace {
+
+using ::testing::HasSubstr;
+
+class EventSocketTest : public DaemonTestBase {
+ protected:
+  void SetUp() override {
+    DaemonTestBase::SetUp();
+    fs::create_directories(root_ / "etc/typhora");
+    std::ofstream(root_ / "etc/typhora/typhorad.launch.plist")
+        << R"({"LaunchEvents": {"systemNotification": ["com.example.ping"]}})";
+    startDaemon();
+  }
+};
+
+TEST_F(EventSocketTest, WatchersSeeEveryPostedNotification) {
+  ChildProcess watcher({kCtl, "--runtime-dir", runtime_, "event", "watch", "--count", "2"});
+  ASSERT_TRUE(watcher.waitForLine("watching", 10s)) << watcher.output();
+
+  auto system = ctl({"event", "post", "--system", "com.example.ping"});
+  ASSERT_EQ(system.status, 0) << system.all;
+  auto distributed = ctl({"event", "post", "--distributed", "com.example.removed",
+                          R"({"bundleIDs": ["com.example.app"]})"});
+  ASSERT_EQ(distributed.status, 0) << distributed.all;
+
+  ASSERT_EQ(watcher.waitFor(10s), 0) << watcher.output();
+  watcher.finishOutput();
+  EXPECT_EQ(watcher.standardOutput(),
+            "{\"kind\":\"system\",\"name\":\"com.example.ping\"}\n"
+            "{\"kind\":\"distributed\",\"name\":\"com.example.removed\","
+            "\"userInfo\":{\"bundleIDs\":[\"com.example.app\"]}}\n");
+}
+
+TEST_F(EventSocketTest, BadRequestsGetClearAnswers) {
+  auto notJson = ctl({"event", "post", "--distributed", "com.example.x", "[1, 2]"});
+  EXPECT_EQ(notJson.status, 2);
+  EXPECT_THAT(notJson.all, HasSubstr("must be a JSON object"));
+
+  auto unknown = ctl({"activity", "run", "com.example.nothing"});
+  EXPECT_EQ(unknown.status, 1);
+  EXPECT_THAT(unknown.all, HasSubstr("no activity com.example.nothing is registered"));
+
+  // The daemon still serves its clients.
+  EXPECT_EQ(ctl({"updating-user-fonts"}).status, 0);
+}
+
+TEST_F(EventSocketTest, OnlyRootAndTheDaemonsUserMayConnect) {
+  if (getuid() != 0) GTEST_SKIP() << "needs root to run a peer as another user";
+  const fs::path socket = runtime_ / "com.zorvane.typhorad.events";
+  struct stat info {};
+  ASSERT_EQ(stat(socket.c_str(), &info), 0);
+  EXPECT_EQ(info.st_mode & 0777, 0600u);
+
+  // Even with the file opened up, the kernel's word on the peer keeps others out.
+  chmod(dir_.c_str(), 0755);
+  chmod(socket.c_str(), 0666);
+  auto other = runCommand({"/usr/bin/setpriv", "--reuid=65534", "--regid=65534", "--clear-groups", kCtl,
+                           "--runtime-dir", runtime_, "event", "post", "--system", "x"},
+                          20s);
+  EXPECT_NE(other.status, 0) << other.all;
+  ASSERT_TRUE(daemon_->waitForLine("event socket: refused", 10s)) << daemon_->output();
+  EXPECT_EQ(ctl({"event", "post", "--system", "x"}).status, 0);
+}
+
+}  // namespace
+}  // namespace typhora::testing
