@@ -7,6 +7,7 @@
 //   exec-after-call DIR    calls echo:reply:, then becomes /bin/sleep
 //   flood DIR              sends large calls on a raw socket and never reads the answers
 //   garbage DIR            sends bytes that are no frame, then a valid call
+//   notes DIR N            N times: connects, sends the one-way note: and closes at once
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
@@ -16,6 +17,7 @@
 #include <thread>
 
 #include "platform/json_codec.h"
+#include "platform/linux/lumo_connection.h"
 #include "platform/linux/lumo_frame.h"
 #include "platform/linux/lumo_service.h"
 #include "platform/semaphore.h"
@@ -106,6 +108,17 @@ int main(int argc, char** argv) {
     auto reply = callA(service, argv[3], {*JsonCodec::decode(argv[4])}, &ok);
     std::cout << JsonCodec::encode(Value(ValueArray(reply))) << std::endl;
     return ok ? 0 : 1;
+  }
+  if (mode == "notes" && argc == 4) {
+    for (int i = std::stoi(argv[3]); i > 0; --i) {
+      auto connection = LumoConnection::toPath(dir + "/test.a");
+      connection->setRemoteInterface(lumoTestInterface());
+      connection->resume();
+      connection->remoteObjectProxy({})->call("note:", {Value("n")});
+      if (!connection->waitUntilSent(std::chrono::seconds(10))) return 1;
+      connection->invalidate();
+    }
+    return 0;
   }
   if (mode == "hang") {
     std::cout << "calling" << std::endl;

@@ -38,6 +38,7 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
       if (op.wireName == "echo:reply:") reply({args[0]});
       if (op.wireName == "count:reply:") reply({Value(*args[0].asInt() + 1)});
       if (op.wireName == "hang:reply:") server_.hung.signal();  // never answered
+      if (op.wireName == "note:") server_.noted.signal();
       if (op.wireName == "endpoint:reply:") reply({Value(server_.anonymous->endpoint())});
       return op.wireName != "useEndpoint:reply:";
     }
@@ -65,6 +66,7 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
   std::atomic<int> invalidations{0};
   Semaphore invalidated;
   Semaphore hung;
+  Semaphore noted;
   AuditToken lastCaller;
 };
 
@@ -134,6 +136,13 @@ TEST_F(LumoTest, BadMessagesAreRefusedAndEveryoneElseIsStillServed) {
   auto good = runCommand(peer({"call", "count:reply:", "41"}), 20s);
   EXPECT_EQ(good.status, 0);
   EXPECT_EQ(good.out, "[42]\n");
+}
+
+TEST_F(LumoTest, OneWayCallsSentJustBeforeThePeerClosesAreServed) {
+  constexpr int kNotes = 50;
+  auto peerRun = runCommand(peer({"notes", std::to_string(kNotes)}), 60s);
+  ASSERT_EQ(peerRun.status, 0) << peerRun.all;
+  for (int i = 0; i < kNotes; ++i) ASSERT_TRUE(server_->noted.waitFor(20s)) << i;
 }
 
 TEST_F(LumoTest, APeerKilledInTheMiddleOfACallRunsTheInvalidationHandlerOnce) {

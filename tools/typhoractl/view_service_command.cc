@@ -2,11 +2,13 @@
 
 #include <fcntl.h>
 
+#include <chrono>
 #include <iostream>
 #include <iterator>
 
 #include "ipc/interface_descriptions.h"
 #include "platform/json_codec.h"
+#include "platform/linux/lumo_connection.h"
 #include "platform/linux/lumo_endpoint.h"
 #include "platform/linux/lumo_service.h"
 
@@ -86,6 +88,12 @@ int runViewServiceCommand(const std::vector<std::string>& args) {
         std::cerr << "typhoractl: " << e << "\n";
       })
       ->call(op::kDoneWithMissingFonts, {*answer});
+  // A one-way answer: it must have left before the connection closes.
+  auto lumo = std::dynamic_pointer_cast<LumoConnection>(connection);
+  if (sent && lumo && !lumo->waitUntilSent(std::chrono::seconds(10))) {
+    std::cerr << "typhoractl: the answer could not be sent\n";
+    sent = false;
+  }
   connection->invalidate();
   return sent ? 0 : 1;
 }

@@ -269,7 +269,9 @@ void LumoConnection::handleInvoke(const LumoMessage& message) {
   std::shared_ptr<IpcExportedObject> object;
   {
     std::lock_guard lock(mutex_);
-    if (!valid_) return;
+    // Messages that arrived before the peer closed are still served: a one-way call followed
+    // at once by the sender's exit must not be lost.
+    if (!valid_ && !servingAfterPeerClosed_) return;
     interface = exportedInterface_;
     object = exportedObject_;
   }
@@ -395,12 +397,19 @@ bool LumoConnection::flushLocked(std::string* error) {
     }
   }
   const bool wantWrites = !outbound_.empty();
+  if (!wantWrites) sent_.notify_all();
   if (wantWrites != watchingWrites_ && resumed_) {
     watchingWrites_ = wantWrites;
     const std::uint32_t events = EPOLLIN | EPOLLRDHUP | (wantWrites ? std::uint32_t{EPOLLOUT} : 0u);
     LumoEventLoop::shared().modify(fd_.get(), events);
   }
   return true;
+}
+
+bool LumoConnection::waitUntilSent(std::chrono::milliseconds timeout) {
+  std::unique_lock lock(mutex_);
+  sent_.wait_for(lock, timeout, [this] { return outbound_.empty() || !valid_; });
+  return outbound_.empty() && !droppedOutbound_;
 }
 
 void LumoConnection::call(const std::string& wireName, std::vector<Value> arguments,
@@ -478,12 +487,17 @@ void LumoConnection::end(const std::string& reason, bool peerWentAway) {
     pending.swap(pending_);
     invalidation = std::move(invalidationHandler_);
     interruption = std::move(interruptionHandler_);
-    object = std::move(exportedObject_);
+    // After the peer closed, the messages queued before the end still need the object; the end
+    // job lets go of it.
+    servingAfterPeerClosed_ = peerWentAway;
+    if (!peerWentAway) object = std::move(exportedObject_);
     // Closing our side: what the socket still takes goes out first, so a last one-way message
     // sent just before invalidate() is not lost.
     std::string ignored;
     if (!peerWentAway && fd_.valid()) flushLocked(&ignored);
+    droppedOutbound_ = !outbound_.empty();
     outbound_.clear();
+    sent_.notify_all();
     outboundBytes_ = 0;
     if (fd_.valid()) {
       LumoEventLoop::shared().remove(fd_.get());
@@ -508,6 +522,12 @@ void LumoConnection::end(const std::string& reason, bool peerWentAway) {
     invalidation = nullptr;
     interruption = nullptr;
     object.reset();
+    std::shared_ptr<IpcExportedObject> kept;
+    {
+      std::lock_guard lock(self->mutex_);
+      self->servingAfterPeerClosed_ = false;
+      kept = std::move(self->exportedObject_);
+    }
   });
 }
 

@@ -11,6 +11,8 @@
 // invalidation handler runs once, always, when the connection ends.
 #pragma once
 
+#include <chrono>
+#include <condition_variable>
 #include <deque>
 #include <map>
 #include <memory>
@@ -50,6 +52,11 @@ class LumoConnection final : public IpcConnection {
       IpcErrorHandler errorHandler) override;
   AuditToken auditToken() const override;
 
+  // Waits until every message sent so far has been written to the socket (a one-way call's
+  // sender can then close without losing it). False on timeout, or when the connection ended
+  // with some of them unwritten.
+  bool waitUntilSent(std::chrono::milliseconds timeout);
+
   // Sends a call of the remote interface (used by the proxies).
   void call(const std::string& wireName, std::vector<Value> arguments, IpcReply onReply,
             IpcErrorHandler onError, bool synchronous);
@@ -87,6 +94,9 @@ class LumoConnection final : public IpcConnection {
   std::function<void()> interruptionHandler_;
   std::deque<std::unique_ptr<Outgoing>> outbound_;
   std::size_t outboundBytes_ = 0;
+  std::condition_variable sent_;  // outbound_ emptied, or the connection ended
+  bool droppedOutbound_ = false;
+  bool servingAfterPeerClosed_ = false;  // ended by the peer; queued messages still served
   std::map<std::uint64_t, std::shared_ptr<Pending>> pending_;
   std::uint64_t nextId_ = 1;
   LumoFrameDecoder decoder_;  // touched only by the I/O thread
