@@ -1,135 +1,177 @@
-// Remote alerts start the configured view-service program: here the real typhoractl playing the
-// view service, which answers on the alert's endpoint.
-#include <dirent.h>
+// Remote alerts start real view-service processes: `typhoractl view-service` answers through the
+// endpoint of this test's anonymous listener.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <unistd.h>
 
-#include <chrono>
+#include <filesystem>
 #include <fstream>
 #include <mutex>
-#include <optional>
+#include <sstream>
+#include <thread>
 
+#include "ipc/interface_descriptions.h"
 #include "platform/json_codec.h"
 #include "platform/linux/linux_remote_alert.h"
 #include "platform/linux/lumo_service.h"
 #include "platform/semaphore.h"
 #include "support/log_capture.h"
-#include "support/temp_directory.h"
 
 namespace typhora {
 namespace {
 
 using namespace std::chrono_literals;
-using testing::TempDirectory;
+namespace fs = std::filesystem;
 
-// The side of the missing-fonts dialog that receives the view service's answer.
-class AnswerReceiver final : public IpcListenerDelegate, public IpcExportedObject {
+constexpr auto kPatience = 30s;
+constexpr const char* kService = "com.zorvane.FontInstallViewService";
+constexpr const char* kController = "FontInstallMissingFontsViewController";
+
+// This process's children as "<pid> <state>", from /proc.
+std::vector<std::string> children() {
+  std::vector<std::string> found;
+  const std::string parent = std::to_string(getpid());
+  std::error_code error;
+  for (const auto& entry : fs::directory_iterator("/proc", error)) {
+    std::ifstream file(entry.path() / "stat");
+    std::string stat;
+    if (!std::getline(file, stat)) continue;
+    const auto close = stat.rfind(')');  // the command name may hold anything
+    if (close == std::string::npos) continue;
+    char state = 0;
+    std::string ppid;
+    std::istringstream(stat.substr(close + 1)) >> state >> ppid;
+    if (ppid == parent) found.push_back(entry.path().filename().string() + " " + state);
+  }
+  return found;
+}
+
+// Waits until every child has ended and been reaped; a zombie stays in the answer.
+std::vector<std::string> childrenLeft() {
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  while (!children().empty() && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(10ms);
+  }
+  return children();
+}
+
+// Accepts view-service connections and records what doneWithMissingFonts: brings.
+class ViewServiceServer final : public IpcListenerDelegate,
+                                public IpcExportedObject,
+                                public std::enable_shared_from_this<ViewServiceServer> {
  public:
-  bool shouldAcceptNewConnection(IpcListener&, std::shared_ptr<IpcConnection> connection) override {
-    static const auto interface = std::make_shared<const IpcInterface>(
-        "FontInstallViewServiceProtocol",
-        std::vector<IpcOperation>{
-            {"doneWithMissingFonts:", {{IpcType::Kind::Array, true}}, false, {}}});
-    connection->setExportedInterface(interface);
-    connection->setExportedObject(std::shared_ptr<IpcExportedObject>(self_.lock(), this));
-    connection->resume();
-    std::lock_guard lock(mutex_);
-    connections_.push_back(std::move(connection));
+  bool shouldAcceptNewConnection(IpcListener&, std::shared_ptr<IpcConnection> c) override {
+    c->setExportedInterface(fontInstallViewServiceProtocol());
+    c->setExportedObject(shared_from_this());
+    c->resume();
     return true;
   }
-  bool invoke(const IpcOperation&, const std::vector<Value>& arguments, IpcReply) override {
+  bool invoke(const IpcOperation& op, const std::vector<Value>& args, IpcReply) override {
+    if (op.wireName != op::kDoneWithMissingFonts) return false;
     {
       std::lock_guard lock(mutex_);
-      answer_ = arguments.at(0);
+      answers_.push_back(args[0]);
     }
     answered_.signal();
     return true;
   }
   std::optional<Value> waitForAnswer() {
-    if (!answered_.waitFor(20s)) return std::nullopt;
+    if (!answered_.waitFor(kPatience)) return std::nullopt;
     std::lock_guard lock(mutex_);
-    return answer_;
+    return answers_.front();
   }
-  std::weak_ptr<AnswerReceiver> self_;
 
  private:
   std::mutex mutex_;
-  Value answer_;
-  std::vector<std::shared_ptr<IpcConnection>> connections_;
+  std::vector<Value> answers_;
   Semaphore answered_;
 };
-
-// Children of this process that have ended but were not reaped.
-int zombieChildren() {
-  int zombies = 0;
-  DIR* proc = opendir("/proc");
-  for (dirent* entry; proc != nullptr && (entry = readdir(proc)) != nullptr;) {
-    std::ifstream stat(std::string("/proc/") + entry->d_name + "/stat");
-    std::string line;
-    if (!std::getline(stat, line)) continue;
-    auto close = line.rfind(')');
-    if (close == std::string::npos) continue;
-    char state = 0;
-    int parent = 0;
-    std::sscanf(line.c_str() + close + 1, " %c %d", &state, &parent);
-    zombies += state == 'Z' && parent == getpid();
-  }
-  if (proc != nullptr) closedir(proc);
-  return zombies;
-}
 
 class LinuxRemoteAlertTest : public ::testing::Test {
  protected:
   void SetUp() override {
-    receiver_->self_ = receiver_;
-    listener_->setDelegate(receiver_);
+    char pattern[] = "/tmp/typhora-alert-XXXXXX";
+    root_ = mkdtemp(pattern);
+    fs::create_directories(root_ + "/etc/typhora/view-services");
+    alert_ = std::make_unique<LinuxRemoteAlert>(root_);
+    listener_ = service_.makeAnonymousListener();
+    listener_->setDelegate(server_);
     listener_->resume();
   }
-  void configure(const std::string& answer) {
-    root_.write("etc/typhora/view-services/com.zorvane.FontInstallViewService.plist",
-                JsonCodec::encode(Value::dictionary(
-                    {{"Program", TYPHORACTL_PATH},
-                     {"Arguments", Value::array({"view-service", "--answer", Value(answer)})}})));
+  void TearDown() override {
+    listener_->invalidate();
+    fs::remove_all(root_);
   }
-  void activate(const Value& userInfo) {
-    auto handle =
-        alert_.makeHandle({"com.zorvane.FontInstallViewService", "FontInstallMissingController"},
-                          {listener_->endpoint()});
-    handle->activate(userInfo);
+  void configure(const std::string& service, const std::string& text) {
+    std::ofstream(root_ + "/etc/typhora/view-services/" + service + ".plist") << text;
+  }
+  void present(const std::string& service, const Value& userInfo) {
+    alert_->makeHandle({service, kController}, {listener_->endpoint()})->activate(userInfo);
   }
 
-  TempDirectory root_;
-  LumoService service_{root_.path()};
-  LinuxRemoteAlert alert_{root_.path()};
-  std::shared_ptr<AnswerReceiver> receiver_ = std::make_shared<AnswerReceiver>();
-  std::shared_ptr<IpcListener> listener_ = service_.makeAnonymousListener();
+  std::string root_;
+  LumoService service_{"/nonexistent"};
+  std::shared_ptr<ViewServiceServer> server_ = std::make_shared<ViewServiceServer>();
+  std::shared_ptr<IpcListener> listener_;
+  std::unique_ptr<LinuxRemoteAlert> alert_;
 };
 
-TEST_F(LinuxRemoteAlertTest, TheViewServiceGetsTheUserInfoAndAnswersOnTheEndpoint) {
-  configure(R"([{"uniqueID": "Family 1", "installProvider": "com.example.shop"}])");
-  ValueArray fonts;
-  for (int i = 0; i < 3000; ++i) {
-    fonts.push_back(Value::dictionary({{"displayName", "Family " + std::to_string(i)},
-                                       {"providers", Value::array({"com.example.shop"})}}));
-  }
-  activate(Value::dictionary({{"fonts", Value(std::move(fonts))}}));  // a few hundred KB
-  auto answer = receiver_->waitForAnswer();
+TEST_F(LinuxRemoteAlertTest, TheViewServiceGetsTheUserInfoAndAnswersThroughTheEndpoint) {
+  // The shell saves what the view service prints; everything else goes through untouched.
+  const std::string printed = root_ + "/printed.json";
+  const std::string script = "exec \"$0\" view-service --print \"$@\" > " + printed;
+  configure(kService, JsonCodec::encode(Value::dictionary({
+                          {"Program", "/bin/sh"},
+                          {"Arguments", Value::array({"-c", script, TYPHORACTL_PATH, "--answer",
+                                                      "[\"Foo-Bold\", \"Bar\"]"})},
+                      })));
+  ValueArray names;
+  for (int i = 0; i < 20000; ++i) names.push_back("MissingFont-" + std::to_string(i));
+  const Value userInfo =
+      Value::dictionary({{"fontNames", names}, {"bundleIdentifier", "com.example.app"}});
+
+  present(kService, userInfo);
+
+  const auto answer = server_->waitForAnswer();
   ASSERT_TRUE(answer.has_value());
-  EXPECT_EQ(*answer, *JsonCodec::decode(
-                         R"([{"uniqueID": "Family 1", "installProvider": "com.example.shop"}])"));
-  for (int i = 0; i < 200 && zombieChildren() > 0; ++i) std::this_thread::sleep_for(10ms);
-  EXPECT_EQ(zombieChildren(), 0);
+  EXPECT_EQ(*answer, Value::array({"Foo-Bold", "Bar"}));
+  EXPECT_THAT(childrenLeft(), ::testing::IsEmpty());
+  std::ifstream file(printed);
+  std::string line;
+  std::getline(file, line);
+  EXPECT_GT(line.size(), 300'000u);
+  EXPECT_EQ(JsonCodec::decode(line), userInfo);
 }
 
-TEST_F(LinuxRemoteAlertTest, AnUnconfiguredServiceIsLoggedAndNothingStarts) {
+TEST_F(LinuxRemoteAlertTest, ProgramsThatIgnoreTheirInputOrFailAreReapedQuietly) {
+  configure("quits", R"({"Program": "/bin/true"})");
+  configure("fails", R"({"Program": "/bin/sh", "Arguments": ["-c", "exit 3"]})");
+  ValueArray big(100000, Value("unread"));
+  for (int i = 0; i < 5; ++i) present("quits", Value::dictionary({{"names", big}}));
   testing::LogCapture log;
-  activate(Value::dictionary({}));
-  EXPECT_TRUE(log.contains("is not configured"));
-  root_.write("etc/typhora/view-services/com.zorvane.FontInstallViewService.plist",
-              R"({"Program": "/nonexistent/program"})");
-  activate(Value::dictionary({}));
-  EXPECT_TRUE(log.contains("/nonexistent/program"));
+  present("fails", Value::dictionary({}));
+  // Writing to a pipe nobody reads any more must not raise SIGPIPE in this process.
+  EXPECT_THAT(childrenLeft(), ::testing::IsEmpty());
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  while (!log.contains("ended with status 3") && std::chrono::steady_clock::now() < deadline) {
+    std::this_thread::sleep_for(10ms);
+  }
+  EXPECT_TRUE(log.contains("ended with status 3"));
+}
+
+TEST_F(LinuxRemoteAlertTest, BadConfigurationsAreLoggedAndStartNothing) {
+  configure("garbled", "{\"Program\": ");
+  configure("relative", R"({"Program": "bin/true"})");
+  configure("arguments", R"({"Program": "/bin/true", "Arguments": [1]})");
+  configure("absent-program", R"({"Program": "/nonexistent/view-service"})");
+  testing::LogCapture log;
+  for (const char* service : {"missing", "garbled", "relative", "arguments", "absent-program",
+                              "../view-services/garbled"}) {
+    present(service, Value::dictionary({}));
+    EXPECT_TRUE(log.contains(std::string("of view service ") + service + ": ")) << service;
+  }
+  for (const auto& line : log.lines()) EXPECT_EQ(line.level, LogLevel::Error) << line.message;
+  EXPECT_THAT(children(), ::testing::IsEmpty());
 }
 
 }  // namespace

@@ -1,101 +1,114 @@
 #include "view_service_command.h"
 
-#include <fcntl.h>
-
 #include <chrono>
 #include <iostream>
 #include <iterator>
+#include <optional>
 
 #include "ipc/interface_descriptions.h"
 #include "platform/json_codec.h"
 #include "platform/linux/lumo_connection.h"
 #include "platform/linux/lumo_endpoint.h"
-#include "platform/linux/lumo_service.h"
 
 namespace typhora::ctl {
-
 namespace {
 
 constexpr const char* kUsage =
     "usage: typhoractl view-service --controller NAME [--answer JSON-ARRAY] [--print]\n"
     "\n"
-    "Plays the font-install view service as the platform starts it for an alert: the user info\n"
-    "arrives as JSON on standard input and the alert's endpoint as descriptor 3. Prints the user\n"
-    "info as one JSON line with --print, then answers the missing-fonts controller with\n"
-    "doneWithMissingFonts: and the given array (default []), and exits.\n";
+    "Plays the font-install view service: reads the user info (JSON) from standard input,\n"
+    "connects to the endpoint passed as descriptor 3 and calls doneWithMissingFonts: with the\n"
+    "answer (default []; null for none). --print prints the user info as one JSON line first.\n";
 
-constexpr int kEndpointDescriptor = 3;
+// The descriptor the daemon hands the endpoint over on.
+constexpr int kEndpointFd = 3;
+constexpr std::chrono::seconds kSendTimeout{30};
 
 struct Options {
   std::string controller;
-  std::string answer = "[]";
+  Value answer = Value(ValueArray{});
   bool print = false;
 };
 
-bool parse(const std::vector<std::string>& args, Options* options) {
+// Parses the arguments; nullopt after saying what is wrong.
+std::optional<Options> parse(const std::vector<std::string>& args) {
+  Options options;
   for (std::size_t i = 0; i < args.size(); ++i) {
+    const bool hasValue = i + 1 < args.size();
     if (args[i] == "--print") {
-      options->print = true;
-    } else if (args[i] == "--controller" && i + 1 < args.size()) {
-      options->controller = args[++i];
-    } else if (args[i] == "--answer" && i + 1 < args.size()) {
-      options->answer = args[++i];
+      options.print = true;
+    } else if (args[i] == "--controller" && hasValue) {
+      options.controller = args[++i];
+    } else if (args[i] == "--answer" && hasValue) {
+      std::string error;
+      auto answer = JsonCodec::decode(args[++i], {}, &error);
+      if (!answer || (!answer->isNull() && answer->asArray() == nullptr)) {
+        std::cerr << "typhoractl: --answer must be a JSON array" << (error.empty() ? "" : ": ")
+                  << error << "\n";
+        return std::nullopt;
+      }
+      options.answer = std::move(*answer);
     } else {
-      return false;
+      std::cerr << "typhoractl: unexpected argument '" << args[i] << "'\n" << kUsage;
+      return std::nullopt;
     }
   }
-  return !options->controller.empty();
+  if (options.controller.empty()) {
+    std::cerr << "typhoractl: --controller is required\n" << kUsage;
+    return std::nullopt;
+  }
+  return options;
+}
+
+std::optional<Value> readUserInfo() {
+  const std::string text{std::istreambuf_iterator<char>(std::cin), {}};
+  std::string error;
+  auto userInfo = JsonCodec::decode(text, {}, &error);
+  if (!userInfo) std::cerr << "typhoractl: the user info is not JSON: " << error << "\n";
+  return userInfo;
+}
+
+bool answer(const Value& doneWith) {
+  std::string error;
+  auto endpoint = LumoEndpoint::inherited(kEndpointFd, &error);
+  if (!endpoint) {
+    std::cerr << "typhoractl: " << error << "\n";
+    return false;
+  }
+  auto connection = LumoConnection::toEndpoint(endpoint);
+  connection->setRemoteInterface(fontInstallViewServiceProtocol());
+  connection->resume();
+  bool failed = false;
+  connection
+      ->synchronousRemoteObjectProxy([&](const std::string& why) {
+        std::cerr << "typhoractl: " << why << "\n";
+        failed = true;
+      })
+      ->call(op::kDoneWithMissingFonts, {doneWith});
+  // The call is one-way: the connection may close only once it is written.
+  if (!failed && !connection->waitUntilSent(kSendTimeout)) {
+    std::cerr << "typhoractl: the answer could not be sent\n";
+    failed = true;
+  }
+  connection->invalidate();
+  return !failed;
 }
 
 }  // namespace
 
 int runViewServiceCommand(const std::vector<std::string>& args) {
-  Options options;
-  if (!args.empty() && (args[0] == "--help" || args[0] == "-h")) {
-    std::cout << kUsage;
-    return 0;
+  for (const std::string& arg : args) {
+    if (arg == "--help" || arg == "-h") {
+      std::cout << kUsage;
+      return 0;
+    }
   }
-  if (!parse(args, &options)) {
-    std::cerr << kUsage;
-    return 2;
-  }
-  std::string error;
-  std::optional<Value> answer = JsonCodec::decode(options.answer, {}, &error);
-  if (!answer || answer->asArray() == nullptr) {
-    std::cerr << "typhoractl: the answer must be a JSON array\n";
-    return 2;
-  }
-  std::string input((std::istreambuf_iterator<char>(std::cin)), std::istreambuf_iterator<char>());
-  std::optional<Value> userInfo = JsonCodec::decode(input, {}, &error);
-  if (!userInfo) {
-    std::cerr << "typhoractl: the user info is not JSON: " << error << "\n";
-    return 1;
-  }
-  if (options.print) std::cout << JsonCodec::encode(*userInfo) << std::endl;
-  if (fcntl(kEndpointDescriptor, F_GETFD) < 0) {
-    std::cerr << "typhoractl: no endpoint on descriptor 3\n";
-    return 1;
-  }
-  fcntl(kEndpointDescriptor, F_SETFD, FD_CLOEXEC);
-  LumoService service("/");
-  auto connection = service.connect(std::make_shared<LumoEndpoint>(UniqueFd(kEndpointDescriptor)));
-  connection->setRemoteInterface(fontInstallViewServiceProtocol());
-  connection->resume();
-  bool sent = true;
-  connection
-      ->remoteObjectProxy([&sent](const std::string& e) {
-        sent = false;
-        std::cerr << "typhoractl: " << e << "\n";
-      })
-      ->call(op::kDoneWithMissingFonts, {*answer});
-  // A one-way answer: it must have left before the connection closes.
-  auto lumo = std::dynamic_pointer_cast<LumoConnection>(connection);
-  if (sent && lumo && !lumo->waitUntilSent(std::chrono::seconds(10))) {
-    std::cerr << "typhoractl: the answer could not be sent\n";
-    sent = false;
-  }
-  connection->invalidate();
-  return sent ? 0 : 1;
+  auto options = parse(args);
+  if (!options) return 2;
+  auto userInfo = readUserInfo();
+  if (!userInfo) return 1;
+  if (options->print) std::cout << JsonCodec::encode(*userInfo) << std::endl;
+  return answer(options->answer) ? 0 : 1;
 }
 
 }  // namespace typhora::ctl

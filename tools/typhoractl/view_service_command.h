@@ -1,4 +1,6 @@
-// `typhoractl view-service`: plays the font-install view service that the daemon's alerts start.
+// `typhoractl view-service`: plays the font-install view service the daemon starts to present a
+// controller. Reads the user info from standard input, connects to the endpoint on descriptor 3
+// and answers through it.
 #pragma once
 
 #include <string>

@@ -1,61 +1,42 @@
-// File events on Linux, from inotify over whole directory trees. The inotify descriptor is
-// watched by lumo's I/O thread, so a stream costs no thread of its own; changes are gathered
-// into a batch that goes to the dispatch queue once the stream's latency has passed since the
-// batch's first change.
+// A file event stream on inotify, over directory trees under a device root.
+//
+// The inotify descriptor is watched by lumo's I/O loop, which only hands the reading over: while
+// a read is queued the descriptor is not watched, so events wait in the kernel (where a flood
+// ends in an overflow, which the stream reports) and never pile up in memory. Reading, watching
+// new directories and batching run on the stream's own serial queue; batches go out on the
+// dispatch queue, each once the latency has passed (on the stream's clock) since its first event.
+//
+// Destroying the stream stops it: no callback starts afterwards, and one already running on
+// another queue is waited for.
 #pragma once
 
 #include <memory>
-#include <mutex>
+#include <string>
 #include <vector>
 
+#include "platform/clock.h"
 #include "platform/file_event_stream.h"
-#include "platform/linux/device_root.h"
-#include "platform/linux/inotify_tree.h"
 
 namespace typhora {
 
 class LinuxFileEventStream final : public FileEventStream {
  public:
-  LinuxFileEventStream(DeviceRoot root, std::vector<std::string> paths, double latencySeconds,
-                       Callback callback);
+  LinuxFileEventStream(std::string deviceRoot, std::vector<std::string> paths,
+                       double latencySeconds, Callback callback, Clock& clock);
   ~LinuxFileEventStream() override;
+  LinuxFileEventStream(const LinuxFileEventStream&) = delete;
+  LinuxFileEventStream& operator=(const LinuxFileEventStream&) = delete;
 
   void setDispatchQueue(std::shared_ptr<SerialQueue> queue) override;
+  // False when inotify cannot be set up or no dispatch queue was set.
   bool start() override;
 
- private:
-  // What the I/O thread and the dispatch queue share; outlives the stream while they use it.
-  struct State {
-    explicit State(DeviceRoot r) : root(std::move(r)) {}
-    DeviceRoot root;
-    std::vector<std::string> paths;
-    Duration latency;
-    Callback callback;
-    std::shared_ptr<SerialQueue> queue;
-    std::unique_ptr<InotifyTree> tree;  // touched on the I/O thread only, once started
-    std::mutex mutex;
-    std::vector<std::string> batch;
-    std::vector<std::string> seen;  // sorted paths of the batch, to merge repeats
-  };
-  static void readEvents(const std::shared_ptr<State>& state);
-  static void deliver(const std::shared_ptr<State>& state);
-
-  std::shared_ptr<State> state_;
-  int fd_ = -1;
-};
-
-class LinuxFileEventStreamFactory final : public FileEventStreamFactory {
- public:
-  explicit LinuxFileEventStreamFactory(std::string root) : root_(std::move(root)) {}
-  std::unique_ptr<FileEventStream> createStream(std::vector<std::string> paths,
-                                                double latencySeconds,
-                                                FileEventStream::Callback callback) override {
-    return std::make_unique<LinuxFileEventStream>(root_, std::move(paths), latencySeconds,
-                                                  std::move(callback));
-  }
+  // What the I/O loop, the stream's queue and the clock's alarm share (opaque).
+  struct Shared;
 
  private:
-  DeviceRoot root_;
+  std::shared_ptr<Shared> shared_;
+  bool started_ = false;
 };
 
 }  // namespace typhora

@@ -20,7 +20,7 @@ LinuxPlatform::LinuxPlatform(const std::string& root, const std::string& runtime
       systemNotify_(*eventHub_),
       activities_(launchConfiguration_, SerialQueue::main()),
       assetCatalog_(root, systemNotify_),
-      fileEvents_(root),
+      fileEvents_(root, Clock::system()),
       remoteAlert_(root),
       bundle_{ipc_,          preferences_,    fileSystem_,        fontManager_,  codeSigning_,
               sandbox_,      appRegistry_,    appStates_,         analytics_,    buildVariant_,

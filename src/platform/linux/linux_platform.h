@@ -13,7 +13,7 @@
 #include "platform/linux/linux_build_variant.h"
 #include "platform/linux/linux_code_signing_query.h"
 #include "platform/linux/linux_event_hub.h"
-#include "platform/linux/linux_file_event_stream.h"
+#include "platform/linux/linux_file_event_stream_factory.h"
 #include "platform/linux/linux_file_system.h"
 #include "platform/linux/linux_launch_event_stream.h"
 #include "platform/linux/linux_remote_alert.h"
