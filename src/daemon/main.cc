@@ -109,10 +109,12 @@ int main(int argc, char** argv) {
   // The platform lives as long as the process: nothing is freed at shutdown.
   static typhora::LinuxPlatform platform(options.root, options.runtimeDir);
   typhora::TyphoraDaemon::installPlatform(platform.bundle());
-  // Events posted before the daemon installs its handlers wait in their streams.
-  platform.startServices();
   typhora::TyphoraDaemon& daemon = typhora::TyphoraDaemon::sharedDaemon();
   daemon.startUp();
+  // The event socket opens after the service socket, which so keeps a lone unnamed activated
+  // socket. An event that started the daemon waits in the socket's backlog until then, and in its
+  // launch event stream until the daemon's handler is installed.
+  platform.startServices();
   typhora::SystemLog("typhorad ready: device root %s, runtime directory %s", options.root,
                      options.runtimeDir);
   daemon.run();

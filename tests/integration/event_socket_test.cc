@@ -19,11 +19,23 @@ class EventSocketTest : public DaemonTestBase {
     fs::create_directories(root_ / "etc/typhora");
     std::ofstream(root_ / "etc/typhora/typhorad.launch.plist")
         << R"({"LaunchEvents": {"systemNotification": ["com.example.ping"]}})";
-    startDaemon();
   }
+  // The event socket opens once the daemon has started up.
+  void waitForEventSocket() {
+    for (int i = 0; i < 1000 && !fs::exists(runtime_ / kEventSocket); ++i)
+      std::this_thread::sleep_for(5ms);
+    ASSERT_TRUE(fs::exists(runtime_ / kEventSocket)) << daemon_->output();
+  }
+  void startDaemonAndEvents() {
+    startDaemon();
+    waitForEventSocket();
+  }
+
+  static constexpr const char* kEventSocket = "com.zorvane.typhorad.events";
 };
 
 TEST_F(EventSocketTest, WatchersSeeEveryPostedNotification) {
+  startDaemonAndEvents();
   ChildProcess watcher({kCtl, "--runtime-dir", runtime_, "event", "watch", "--count", "2"});
   ASSERT_TRUE(watcher.waitForLine("watching", 10s)) << watcher.output();
 
@@ -42,6 +54,7 @@ TEST_F(EventSocketTest, WatchersSeeEveryPostedNotification) {
 }
 
 TEST_F(EventSocketTest, BadRequestsGetClearAnswers) {
+  startDaemonAndEvents();
   auto notJson = ctl({"event", "post", "--distributed", "com.example.x", "[1, 2]"});
   EXPECT_EQ(notJson.status, 2);
   EXPECT_THAT(notJson.all, HasSubstr("must be a JSON object"));
@@ -56,7 +69,8 @@ TEST_F(EventSocketTest, BadRequestsGetClearAnswers) {
 
 TEST_F(EventSocketTest, OnlyRootAndTheDaemonsUserMayConnect) {
   if (getuid() != 0) GTEST_SKIP() << "needs root to run a peer as another user";
-  const fs::path socket = runtime_ / "com.zorvane.typhorad.events";
+  startDaemonAndEvents();
+  const fs::path socket = runtime_ / kEventSocket;
   struct stat info {};
   ASSERT_EQ(stat(socket.c_str(), &info), 0);
   EXPECT_EQ(info.st_mode & 0777, 0600u);
@@ -64,12 +78,34 @@ TEST_F(EventSocketTest, OnlyRootAndTheDaemonsUserMayConnect) {
   // Even with the file opened up, the kernel's word on the peer keeps others out.
   chmod(dir_.c_str(), 0755);
   chmod(socket.c_str(), 0666);
-  auto other = runCommand({"/usr/bin/setpriv", "--reuid=65534", "--regid=65534", "--clear-groups", kCtl,
-                           "--runtime-dir", runtime_, "event", "post", "--system", "x"},
+  auto other = runCommand({"/usr/bin/setpriv", "--reuid=65534", "--regid=65534", "--clear-groups",
+                           kCtl, "--runtime-dir", runtime_, "event", "post", "--system", "x"},
                           20s);
   EXPECT_NE(other.status, 0) << other.all;
   ASSERT_TRUE(daemon_->waitForLine("event socket: refused", 10s)) << daemon_->output();
   EXPECT_EQ(ctl({"event", "post", "--system", "x"}).status, 0);
+}
+
+TEST_F(EventSocketTest, AnEventStartsTheDaemonThroughSocketActivation) {
+  const std::string activate = "/usr/bin/systemd-socket-activate";
+  if (!fs::exists(activate)) GTEST_SKIP() << "systemd-socket-activate is not installed";
+  std::vector<std::string> argv = {activate,
+                                   "-l",
+                                   (runtime_ / kService).string(),
+                                   "-l",
+                                   (runtime_ / kEventSocket).string(),
+                                   std::string("--fdname=") + kService + ":" + kEventSocket};
+  auto args = daemonArgs();
+  argv.insert(argv.end(), args.begin(), args.end());
+  daemon_ = std::make_unique<ChildProcess>(argv);
+  waitForEventSocket();
+
+  // The post starts the daemon, which answers it on the inherited socket.
+  auto posted = ctl({"event", "post", "--system", "com.example.ping"});
+  ASSERT_EQ(posted.status, 0) << posted.all << daemon_->output();
+  EXPECT_TRUE(daemon_->waitForLine("notification posted: com.example.ping", 10s))
+      << daemon_->output();
+  EXPECT_EQ(ctl({"updating-user-fonts"}).status, 0) << daemon_->output();
 }
 
 }  // namespace

@@ -44,6 +44,7 @@ bool LinuxEventHub::shouldAcceptNewConnection(IpcListener& /*listener*/,
 
 void LinuxEventHub::post(LaunchEventStreamKind kind, const std::string& name,
                          const Value& userInfo) {
+  TYLog_Debug(kTYLogTyphoraDaemon, "notification posted: %@ (%s)", name, kindName(kind));
   streams_.deliver(kind, name, userInfo);
   std::vector<std::shared_ptr<IpcConnection>> watchers;
   {

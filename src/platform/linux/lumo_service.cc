@@ -10,6 +10,8 @@
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
+#include <mutex>
+#include <set>
 
 #include "platform/linux/lumo_connection.h"
 #include "platform/linux/lumo_listener.h"
@@ -18,8 +20,12 @@
 namespace typhora {
 namespace {
 
-// The activated socket named `name`, or -1. Descriptors handed over are kept for the process.
+// The activated socket named `name`, or -1. Descriptors handed over are kept for the process,
+// and each is handed out once: a single unnamed socket goes to the first listener that asks.
 int activatedSocket(const std::string& name) {
+  static std::mutex mutex;
+  static std::set<int> taken;
+  std::lock_guard lock(mutex);
   char** names = nullptr;
   int count = sd_listen_fds_with_names(0, &names);
   int found = -1;
@@ -27,8 +33,11 @@ int activatedSocket(const std::string& name) {
     // A single socket handed over without a name is taken as the service's own.
     bool matches = names != nullptr && names[i] != nullptr &&
                    (name == names[i] || (count == 1 && std::strcmp(names[i], "unknown") == 0));
-    if (matches && found < 0) found = SD_LISTEN_FDS_START + i;
+    if (matches && found < 0 && !taken.contains(SD_LISTEN_FDS_START + i)) {
+      found = SD_LISTEN_FDS_START + i;
+    }
   }
+  if (found >= 0) taken.insert(found);
   if (names != nullptr) {
     for (int i = 0; i < count; ++i) std::free(names[i]);
     std::free(names);
