@@ -45,6 +45,9 @@ bool LinuxEventHub::shouldAcceptNewConnection(IpcListener& /*listener*/,
 void LinuxEventHub::post(LaunchEventStreamKind kind, const std::string& name,
                          const Value& userInfo) {
   TYLog_Debug(kTYLogTyphoraDaemon, "notification posted: %@ (%s)", name, kindName(kind));
+  // One post at a time: the streams and every watcher see posts in the same order. Nothing
+  // below blocks; watchers' messages are only queued.
+  std::lock_guard order(postMutex_);
   streams_.deliver(kind, name, userInfo);
   std::vector<std::shared_ptr<IpcConnection>> watchers;
   {

@@ -37,7 +37,8 @@ class LinuxEventHub final : public IpcListenerDelegate,
   LumoService& ipc_;
   LinuxLaunchEventStream& streams_;
   std::shared_ptr<IpcListener> listener_;
-  std::mutex mutex_;
+  std::mutex postMutex_;  // held across one whole post
+  std::mutex mutex_;      // watchers_ and activityRunner_
   std::vector<std::weak_ptr<IpcConnection>> watchers_;
   ActivityRunner activityRunner_;
 };
