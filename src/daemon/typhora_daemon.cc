@@ -66,7 +66,6 @@ void TyphoraDaemon::setupForLumoService() {
 // Start-up steps whose subsystems arm nothing yet.
 void TyphoraDaemon::setupForScheduledFontDeletion() {}
 void TyphoraDaemon::setupForDistributedNotifications() {}
-void TyphoraDaemon::setupForBlacklistUpdatedNotification() {}
 void TyphoraDaemon::setupForMonitoringFontAssets() {}
 
 void TyphoraDaemon::setup() {

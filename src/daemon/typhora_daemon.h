@@ -5,6 +5,7 @@
 #include <functional>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -82,11 +83,30 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   // The daemon's path of the user-fonts file.
   static std::string userFontsFilePath();
 
-  // --- Access control (access/) ---
+  // --- Access control: capabilities (access/capabilities.cc) ---
+
+  // The caller's capabilities from its signing record; all four out-arguments are always written
+  // (false, false, false and absent when no record can be made).
+  void capabilitiesFor(const AuditToken& token, bool* allowEnumerate, bool* allowUserFonts,
+                       bool* allowInstallation, std::optional<std::string>* andIdentifier);
+  // False when the block list refuses the application's current short version.
+  bool isIdentifierAllowed(const std::string& identifier);
+  bool isAuditTokenSandboxed(const AuditToken& token);
+  // Whether the peer of the current connection is the system font picker.
+  bool isCurrentConnectionFontPicker();
 
   // The font-access block list. The only field read and written without mainHandlerQueue.
   Value blacklistInfo() const;
   void setBlacklistInfo(Value list);
+
+  // --- Font files and assets: the asset catalog (maintenance/asset_catalog.cc) ---
+
+  // The block list's loading queue, made on first use and kept for the process.
+  SerialQueue& assetHandlerQueue();
+  // Loads the block list from the asset catalog; runs on assetHandlerQueue.
+  void loadBlacklist();
+  // The catalog-update activity's handler.
+  void checkAssetUpdate(ScheduledActivityState state);
 
  private:
   SerialQueue& updateQueue();

@@ -18,7 +18,8 @@ class EventSocketTest : public DaemonTestBase {
     DaemonTestBase::SetUp();
     fs::create_directories(root_ / "etc/typhora");
     std::ofstream(root_ / "etc/typhora/typhorad.launch.plist")
-        << R"({"LaunchEvents": {"systemNotification": ["com.example.ping"]}})";
+        << R"({"LaunchEvents": {"systemNotification": ["com.example.ping"]},
+               "Activities": {"com.zorvane.typhorad.check-asset-update": {"Interval": 86400}}})";
   }
   // The event socket opens once the daemon has started up.
   void waitForEventSocket() {
@@ -84,6 +85,26 @@ TEST_F(EventSocketTest, OnlyRootAndTheDaemonsUserMayConnect) {
   EXPECT_NE(other.status, 0) << other.all;
   ASSERT_TRUE(daemon_->waitForLine("event socket: refused", 10s)) << daemon_->output();
   EXPECT_EQ(ctl({"event", "post", "--system", "x"}).status, 0);
+}
+
+TEST_F(EventSocketTest, TheCatalogActivityDownloadsAndTheAssetServiceAnnouncesIt) {
+  std::ofstream(dir_ / "catalog.json") << R"([{"type": "FontAccess",
+      "_CompatibilityVersion": "1", "FontAccess": {"com.example.app": ["1.0"]}}])";
+  std::ofstream(root_ / "etc/typhora/asset-sources.plist")
+      << R"({"com.zorvane.Cargell.ScrivaneAssets": ")" << (dir_ / "catalog.json").string()
+      << R"("})";
+  startDaemonAndEvents();
+  ChildProcess watcher({kCtl, "--runtime-dir", runtime_, "event", "watch", "--count", "1"});
+  ASSERT_TRUE(watcher.waitForLine("watching", 10s)) << watcher.output();
+
+  auto run = ctl({"activity", "run", "com.zorvane.typhorad.check-asset-update"});
+  ASSERT_EQ(run.status, 0) << run.all << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLine("asset catalog updated. (0)", 10s)) << daemon_->output();
+  ASSERT_EQ(watcher.waitFor(10s), 0) << watcher.output();
+  EXPECT_THAT(watcher.output(),
+              HasSubstr("com.zorvane.Cargell.ScrivaneAssets.cg.cached-metadata-updated"));
+  EXPECT_TRUE(
+      fs::exists(root_ / "var/typhora/assets/com.zorvane.Cargell.ScrivaneAssets/catalog.plist"));
 }
 
 TEST_F(EventSocketTest, AnEventStartsTheDaemonThroughSocketActivation) {

@@ -1,0 +1,73 @@
+// A caller's capabilities: enumeration, font access and installation, from the entitlement
+// "com.zorvane.developer.user-fonts" of its signing record, with the block list for enumeration.
+#include <algorithm>
+
+#include "daemon/typhora_daemon.h"
+#include "platform/log.h"
+
+namespace typhora {
+
+namespace {
+
+constexpr const char* kUserFontsEntitlement = "com.zorvane.developer.user-fonts";
+constexpr const char* kFontEnumeration = "font-enumeration";
+constexpr const char* kAppUsage = "app-usage";
+constexpr const char* kSystemInstallation = "system-installation";
+constexpr const char* kFontPickerIdentifier = "com.zorvane.Panelor.FontPicker";
+constexpr const char* kBlacklisted = "BLACKLISTED - %@";
+
+bool containsString(const ValueArray& items, const std::string& wanted) {
+  return std::any_of(items.begin(), items.end(), [&wanted](const Value& item) {
+    const std::string* text = item.asString();
+    return text != nullptr && *text == wanted;
+  });
+}
+
+}  // namespace
+
+void TyphoraDaemon::capabilitiesFor(const AuditToken& token, bool* allowEnumerate,
+                                    bool* allowUserFonts, bool* allowInstallation,
+                                    std::optional<std::string>* andIdentifier) {
+  *allowEnumerate = *allowUserFonts = *allowInstallation = false;
+  *andIdentifier = std::nullopt;
+  std::optional<CodeSigningRecord> record = platform_.codeSigning.codeSigningRecord(token);
+  if (!record) return;
+  const ValueArray* capabilities = record->entitlementValue(kUserFontsEntitlement).asArray();
+  const bool enumeration =
+      capabilities != nullptr && containsString(*capabilities, kFontEnumeration);
+  *allowUserFonts = capabilities != nullptr && containsString(*capabilities, kAppUsage);
+  *allowInstallation =
+      capabilities != nullptr && containsString(*capabilities, kSystemInstallation);
+  *andIdentifier = record->signingIdentifier();
+  *allowEnumerate =
+      enumeration && andIdentifier->has_value() && isIdentifierAllowed(**andIdentifier);
+}
+
+bool TyphoraDaemon::isIdentifierAllowed(const std::string& identifier) {
+  const Value list = blacklistInfo();  // one read of the whole list
+  const ValueArray* elements = list.asArray();
+  if (elements == nullptr) return true;
+  for (const Value& element : *elements) {
+    // Elements of another shape are skipped: the list comes from catalog data as it stands.
+    const ValueArray* refused = element.get(identifier).asArray();
+    if (refused == nullptr) continue;
+    std::optional<std::string> version = platform_.appRegistry.shortVersionString(identifier);
+    if (version && containsString(*refused, *version)) {
+      SystemLog(kBlacklisted, identifier);
+      return false;
+    }
+  }
+  return true;
+}
+
+bool TyphoraDaemon::isAuditTokenSandboxed(const AuditToken& token) {
+  return platform_.sandbox.sandboxCheck(token) != 0;
+}
+
+bool TyphoraDaemon::isCurrentConnectionFontPicker() {
+  std::optional<CodeSigningRecord> record =
+      platform_.codeSigning.codeSigningRecord(currentAuditToken());
+  return record && record->signingIdentifier() == kFontPickerIdentifier;
+}
+
+}  // namespace typhora
