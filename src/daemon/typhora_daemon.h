@@ -99,6 +99,20 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   Value blacklistInfo() const;
   void setBlacklistInfo(Value list);
 
+  // --- Issued-fonts ledger (ledger/issued_font_paths.cc) ---
+  // The paths issued to each application, in the preference "issues". Every operation reads and
+  // writes the whole dictionary under ledgerMutex_, from whichever queue calls it.
+
+  // The stored forms of the paths that are keys of the user-fonts information, without repeats.
+  std::vector<std::string> sanitizeIssuedFontPaths(const std::vector<std::string>& paths);
+  void recordIssuedFontPaths(const std::optional<std::vector<std::string>>& paths,
+                             const std::optional<std::string>& forIdentifier);
+  // The absolute paths issued to `identifier`; empty when it has no entry.
+  std::vector<std::string> issuedFontFilePathsForIdentifier(const std::string& identifier);
+  void forgetClientApplication(const std::optional<std::string>& identifier);
+  // IPC: forgets `identifier`'s entry when the caller holds the reset entitlement; always replies.
+  void resetIssuedFontsFor(const std::string& identifier, const IpcReply& reply);
+
   // --- Font files and assets: the asset catalog (maintenance/asset_catalog.cc) ---
 
   // The block list's loading queue, made on first use and kept for the process.
@@ -112,6 +126,9 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   SerialQueue& updateQueue();
   // The cache, loaded from disk when absent. Called with userFontsInfoMutex_ held.
   const Value& loadedUserFontsInfoLocked();
+  std::vector<std::string> issuedFontFilePathsLocked(const Dictionary* issues,
+                                                     const std::string& identifier);
+  void writeIssues(std::vector<DictionaryEntry> entries);
 
   Platform& platform_;
 
@@ -128,6 +145,9 @@ class TyphoraDaemon final : public IpcListenerDelegate,
 
   // Only keeps the service listener open for the life of the process; nothing reads it.
   std::shared_ptr<IpcListener> listener_;
+
+  // Serialises the ledger's read-modify-write of "issues" across the queues that reach it.
+  std::mutex ledgerMutex_;
 
   std::once_flag updateQueueOnce_;
   std::shared_ptr<SerialQueue> updateQueue_;

@@ -22,11 +22,14 @@ bool TyphoraDaemon::shouldAcceptNewConnection(IpcListener& /*listener*/,
 }
 
 bool TyphoraDaemon::forwardInvocation(const IpcOperation& operation,
-                                      const std::vector<Value>& /*arguments*/,
-                                      const IpcReply& reply) {
+                                      const std::vector<Value>& arguments, const IpcReply& reply) {
   const std::string& name = operation.wireName;
   if (name == op::kUpdatingUserFonts) {
     updatingUserFonts([&reply] { reply({}); });
+    return true;
+  }
+  if (name == op::kResetIssuedFontsFor) {
+    resetIssuedFontsFor(*arguments.at(0).asString(), reply);
     return true;
   }
   return false;

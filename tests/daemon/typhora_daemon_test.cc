@@ -152,7 +152,7 @@ TEST_F(DaemonTest, OperationsReachTheDaemonOnlyWhenItCarriesThemOut) {
     EXPECT_FALSE(refused.accepted) << name;
     EXPECT_FALSE(refused.reply.has_value()) << name;
   }
-  EXPECT_FALSE(client->deliver(op::kResetIssuedFontsFor, {Value("com.a")}).accepted);
+  EXPECT_FALSE(client->deliver(op::kRequestFonts, {Value(ValueArray{})}).accepted);
   // sendFonts:reply: is accepted and never answered.
   auto sent = client->deliver(op::kSendFonts, {Value(Dictionary())});
   EXPECT_TRUE(sent.accepted);
