@@ -6,6 +6,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -94,6 +95,31 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   bool isAuditTokenSandboxed(const AuditToken& token);
   // Whether the peer of the current connection is the system font picker.
   bool isCurrentConnectionFontPicker();
+
+  // --- Access control: sandbox extensions and filtering (access/sandbox_extensions.cc) ---
+
+  // Decides per entry whether a caller gets it; setting `covered` says another token already
+  // opens the file.
+  using FontFilter =
+      std::function<bool(const std::string& path, const Value& record, bool* covered)>;
+
+  // Extension token values (data: the token text and its terminating zero byte), or null.
+  Value sandboxExtensionForEnumeration(const AuditToken& token);
+  Value sandboxExtensionForFontAssets(const AuditToken& token);
+  Value sandboxExtensionForProvider(const AuditToken& token, const std::string& withDirectoryName);
+  // The user-fonts entries the filter keeps, as this process may receive them (a dictionary).
+  Value filterUserFontInfoForAuditToken(const AuditToken& token, bool withEnumerationCapability,
+                                        const FontFilter& withFilter);
+  Value fontInfoForAuditToken(const AuditToken& token, bool withEnumuration, bool installation,
+                              const std::optional<std::string>& identifier,
+                              const std::optional<std::set<std::string>>& andFileFilters,
+                              std::optional<std::string>* foundFontDirectoryName);
+  // Builds the check-in dictionary on mainHandlerQueue and replies from there; replies absent at
+  // once when no capability is set. Never call it from mainHandlerQueue.
+  void setupUserInstalledFontsFor(const AuditToken& token, const AuditToken& withCapabilitiesFor,
+                                  bool hasEnumeration, bool hasFontAccess, bool isFontProvider,
+                                  const std::optional<std::string>& processIdentifier,
+                                  const IpcReply& reply);
 
   // The font-access block list. The only field read and written without mainHandlerQueue.
   Value blacklistInfo() const;

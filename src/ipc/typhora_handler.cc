@@ -28,11 +28,67 @@ bool TyphoraHandler::invoke(const IpcOperation& operation, const std::vector<Val
     // Accepted and deliberately never answered.
     return true;
   }
-  if (name == op::kCheckin || name == op::kCheckinForFontPicker ||
-      name == op::kCheckinForBrisvelProcess) {
-    return false;  // check-in is not served yet: refused as unrecognised
+  if (name == op::kCheckin) {
+    checkin(reply);
+    return true;
+  }
+  if (name == op::kCheckinForFontPicker) {
+    checkinForFontPicker(reply);
+    return true;
+  }
+  if (name == op::kCheckinForBrisvelProcess) {
+    return false;  // web-content check-in is not served yet: refused as unrecognised
   }
   return server_->forwardInvocation(operation, arguments, reply);
+}
+
+void TyphoraHandler::checkin(const IpcReply& reply) {
+  const AuditToken token = currentAuditToken();
+  bool enumeration = false;
+  bool fontAccess = false;
+  bool provider = false;
+  std::optional<std::string> identifier;
+  server_->capabilitiesFor(token, &enumeration, &fontAccess, &provider, &identifier);
+  {
+    std::lock_guard lock(mutex_);
+    hasEnumerationEntitlement_ = enumeration;
+    hasFontAccessEntitlement_ = fontAccess;
+    isFontProvider_ = provider;
+  }
+  if (isProcessIdentifierToIgnore(identifier ? &*identifier : nullptr)) {
+    reply({Value()});
+    return;
+  }
+  server_->setupUserInstalledFontsFor(token, token, enumeration, fontAccess, provider, identifier,
+                                      reply);
+  if (provider) {
+    std::lock_guard lock(mutex_);
+    processIdentifier_ = identifier;
+  }
+}
+
+void TyphoraHandler::checkinForFontPicker(const IpcReply& reply) {
+  if (!server_->isCurrentConnectionFontPicker()) {
+    reply({Value()});
+    return;
+  }
+  const AuditToken token = currentAuditToken();
+  server_->mainHandlerQueue().sync([&] {
+    {
+      std::lock_guard lock(mutex_);
+      hasEnumerationEntitlement_ = true;
+    }
+    Value fonts = server_->filterUserFontInfoForAuditToken(
+        token, true, [](const std::string&, const Value& record, bool*) {
+          return record.get("disabled").asBool() != true;
+        });
+    std::vector<DictionaryEntry> checkin{{"fontsInfo", std::move(fonts)}};
+    if (Value extension = server_->sandboxExtensionForEnumeration(token); !extension.isNull())
+      checkin.emplace_back("extension", extension);
+    if (Value extension = server_->sandboxExtensionForFontAssets(token); !extension.isNull())
+      checkin.emplace_back("extension.fontasset", extension);
+    reply({Value(Dictionary(std::move(checkin)))});
+  });
 }
 
 bool TyphoraHandler::isProcessIdentifierToIgnore(const std::string* identifier) {

@@ -24,6 +24,11 @@ class TyphoraHandler final : public IpcExportedObject,
   bool invoke(const IpcOperation& operation, const std::vector<Value>& arguments,
               IpcReply reply) override;
 
+  // The two check-ins, on the connection's queue: capabilities from the caller's signature, then
+  // the fonts and tokens it may have.
+  void checkin(const IpcReply& reply);
+  void checkinForFontPicker(const IpcReply& reply);
+
   // True exactly for the font-registry library's own process identifier (case-sensitive).
   static bool isProcessIdentifierToIgnore(const std::string* identifier);
 

@@ -147,8 +147,9 @@ TEST_F(DaemonTest, OperationsReachTheDaemonOnlyWhenItCarriesThemOut) {
   // A daemon operation, sent without any check-in.
   EXPECT_TRUE(client->deliver(op::kUpdatingUserFonts, {}).reply.has_value());
   // Operations of the interface not carried out yet are refused as unrecognised.
-  for (const char* name : {op::kCheckin, op::kCheckinForFontPicker}) {
-    auto refused = client->deliver(name, {});
+  for (const char* name : {op::kFontChanged, op::kSynchronizeFontAssets}) {
+    auto refused = client->deliver(
+        name, {name == op::kFontChanged ? Value(Dictionary()) : Value(ValueArray{})});
     EXPECT_FALSE(refused.accepted) << name;
     EXPECT_FALSE(refused.reply.has_value()) << name;
   }

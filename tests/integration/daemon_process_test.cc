@@ -58,8 +58,8 @@ TEST_F(DaemonProcessTest, RefusedOperationsLeaveTheDaemonServing) {
   (void)wrongType;
 
   // An operation of the service that the daemon does not carry out is refused as unrecognised.
-  auto checkin = ctl({"call", "checkin:"});
-  EXPECT_NE(checkin.status, 0) << checkin.all;
+  auto request = ctl({"call", "requestFonts:reply:", "[\"Serif\"]"});
+  EXPECT_NE(request.status, 0) << request.all;
 
   auto ok = ctl({"updating-user-fonts"});
   EXPECT_EQ(ok.status, 0) << ok.all << daemon_->output();

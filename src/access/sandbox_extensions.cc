@@ -1,0 +1,165 @@
+// What a caller receives of the user-fonts information, and the sandbox extension tokens that
+// open it: directory-wide for enumeration and providers, one per file for issued fonts.
+#include "daemon/paths.h"
+#include "daemon/typhora_daemon.h"
+#include "platform/log.h"
+#include "platform/utf8.h"
+
+namespace typhora {
+
+namespace {
+
+constexpr const char* kEnumerationPath = "/var/mobile/Library/UserFonts/FontFiles";
+constexpr const char* kProviderPathFormat = "/var/mobile/Library/UserFonts/FontFiles/%@";
+
+// The token as the daemon hands it on: its text followed by the terminating zero byte.
+Value tokenValue(const std::string& token) {
+  Bytes bytes(token.begin(), token.end());
+  bytes.push_back(0);
+  return Value(std::move(bytes));
+}
+
+// The name of the directory that directly holds `path`.
+std::string_view containingDirectoryName(std::string_view path) {
+  const std::size_t last = path.rfind('/');
+  if (last == std::string_view::npos) return {};
+  const std::string_view directory = path.substr(0, last);
+  const std::size_t before = directory.rfind('/');
+  return before == std::string_view::npos ? directory : directory.substr(before + 1);
+}
+
+bool isDisabled(const Value& record) {
+  return record.get("disabled").asBool() == true;
+}
+
+Value copyForClient(const Value& record, const Value& token) {
+  std::vector<DictionaryEntry> fields;
+  if (const Dictionary* dictionary = record.asDictionary()) fields = dictionary->entries();
+  std::erase_if(fields, [](const DictionaryEntry& field) { return field.first == "disabled"; });
+  if (!token.isNull()) {
+    std::erase_if(fields, [](const DictionaryEntry& field) { return field.first == "data"; });
+    fields.emplace_back("data", token);
+  }
+  return Value(Dictionary(std::move(fields)));
+}
+
+}  // namespace
+
+Value TyphoraDaemon::sandboxExtensionForEnumeration(const AuditToken& token) {
+  std::optional<std::string> issued =
+      platform_.sandbox.issueReadOnlyExtension(kEnumerationPath, token);
+  return issued ? tokenValue(*issued) : Value();
+}
+
+Value TyphoraDaemon::sandboxExtensionForFontAssets(const AuditToken& token) {
+  const std::string& path = fontAssetsDirectoryPrefix();
+  if (platform_.sandbox.sandboxCheck(token, kSandboxOperationFileReadData, path) == 0) return {};
+  std::optional<std::string> issued = platform_.sandbox.issueReadOnlyExtension(path, token);
+  return issued ? tokenValue(*issued) : Value();
+}
+
+Value TyphoraDaemon::sandboxExtensionForProvider(const AuditToken& token,
+                                                 const std::string& withDirectoryName) {
+  const std::string path = formatLog(kProviderPathFormat, {withDirectoryName});
+  if (!isValidUtf8(path)) return {};
+  if (platform_.sandbox.sandboxCheck(token, kSandboxOperationFileReadData, path) == 0) return {};
+  std::optional<std::string> issued = platform_.sandbox.issueReadOnlyExtension(path, token);
+  return issued ? tokenValue(*issued) : Value();
+}
+
+Value TyphoraDaemon::filterUserFontInfoForAuditToken(const AuditToken& token,
+                                                     bool withEnumerationCapability,
+                                                     const FontFilter& withFilter) {
+  const bool sandboxed = isAuditTokenSandboxed(token);
+  const Value info = userFontsInfo();
+  const Dictionary* entries = info.asDictionary();
+  if (entries == nullptr) return Value(Dictionary());
+  std::vector<DictionaryEntry> result;
+  for (const auto& [path, record] : entries->entries()) {
+    bool covered = false;
+    if (!withFilter(path, record, &covered)) continue;
+    if (isAssetStorePath(path)) covered = true;
+    if (!sandboxed || withEnumerationCapability) {
+      result.emplace_back(path, record);  // the cached record itself
+      continue;
+    }
+    if (covered) {
+      result.emplace_back(path, copyForClient(record, Value()));
+      continue;
+    }
+    // A sandboxed caller that can already read the file gets nothing for it.
+    if (platform_.sandbox.sandboxCheck(token, kSandboxOperationFileReadData, path) == 0) continue;
+    std::optional<std::string> issued = platform_.sandbox.issueReadOnlyExtension(path, token);
+    result.emplace_back(path, copyForClient(record, issued ? tokenValue(*issued) : Value()));
+  }
+  return Value(Dictionary(std::move(result)));
+}
+
+Value TyphoraDaemon::fontInfoForAuditToken(
+    const AuditToken& token, bool withEnumuration, bool installation,
+    const std::optional<std::string>& identifier,
+    const std::optional<std::set<std::string>>& andFileFilters,
+    std::optional<std::string>* foundFontDirectoryName) {
+  std::optional<std::string> directory;
+  if (installation && identifier && !withEnumuration)
+    directory = platform_.fontManager.directoryNameFromIdentifier(*identifier);
+  bool found = false;
+  Value result = filterUserFontInfoForAuditToken(
+      token, withEnumuration, [&](const std::string& path, const Value& record, bool* covered) {
+        if (andFileFilters && !andFileFilters->contains(path)) return false;
+        if (isDisabled(record)) return false;
+        if (withEnumuration) return true;
+        if (!installation) return false;
+        if (!directory || containingDirectoryName(path) != *directory) return false;
+        *covered = true;
+        found = true;
+        return true;
+      });
+  if (foundFontDirectoryName != nullptr && found) *foundFontDirectoryName = directory;
+  return result;
+}
+
+void TyphoraDaemon::setupUserInstalledFontsFor(const AuditToken& token,
+                                               const AuditToken& /*withCapabilitiesFor*/,
+                                               bool hasEnumeration, bool hasFontAccess,
+                                               bool isFontProvider,
+                                               const std::optional<std::string>& processIdentifier,
+                                               const IpcReply& reply) {
+  if (!hasEnumeration && !hasFontAccess && !isFontProvider) {
+    reply({Value()});
+    return;
+  }
+  mainHandlerQueue().sync([&] {
+    std::vector<DictionaryEntry> fonts;
+    std::optional<std::string> directory;
+    if (hasEnumeration || isFontProvider) {
+      Value found = fontInfoForAuditToken(token, hasEnumeration, isFontProvider, processIdentifier,
+                                          std::nullopt, &directory);
+      fonts = found.asDictionary()->entries();
+    }
+    if (!hasEnumeration && hasFontAccess && processIdentifier) {
+      const std::vector<std::string> issued = issuedFontFilePathsForIdentifier(*processIdentifier);
+      const std::set<std::string> wanted(issued.begin(), issued.end());
+      Value granted = filterUserFontInfoForAuditToken(
+          token, false, [&wanted](const std::string& path, const Value&, bool*) {
+            return wanted.contains(path);
+          });
+      // Entries of the same path replace the earlier ones: the later entry wins.
+      for (const auto& entry : granted.asDictionary()->entries()) fonts.push_back(entry);
+    }
+    std::vector<DictionaryEntry> checkin{{"fontsInfo", Value(Dictionary(std::move(fonts)))}};
+    if (hasEnumeration) {
+      if (Value extension = sandboxExtensionForEnumeration(token); !extension.isNull())
+        checkin.emplace_back("extension", extension);
+      if (Value extension = sandboxExtensionForFontAssets(token); !extension.isNull())
+        checkin.emplace_back("extension.fontasset", extension);
+    } else if (directory) {
+      if (Value extension = sandboxExtensionForProvider(token, *directory); !extension.isNull())
+        checkin.emplace_back("extension.provider", extension);
+    }
+    if (!hasEnumeration && !hasFontAccess) checkin.emplace_back("hide-profilefonts", true);
+    reply({Value(Dictionary(std::move(checkin)))});
+  });
+}
+
+}  // namespace typhora
