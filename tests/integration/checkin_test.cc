@@ -1,0 +1,60 @@
+// Check-in with real processes: applications are copies of typhoractl that the platform's
+// manifests sign with their own identifiers and entitlements.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include "integration/daemon_test_base.h"
+
+namespace typhora::testing {
+namespace {
+
+using ::testing::HasSubstr;
+using ::testing::Not;
+
+class CheckinProcessTest : public DaemonTestBase {
+ protected:
+  // Installs a copy of typhoractl as application `name`, sandboxed, with `entitlements` (JSON).
+  std::string install(const std::string& name, const std::string& identifier,
+                      const std::string& entitlements) {
+    const fs::path program = dir_ / "apps" / name;
+    fs::create_directories(program.parent_path());
+    fs::copy_file(kCtl, program);
+    auto digest = runCommand({"/usr/bin/sha256sum", program.string()}, 20s);
+    fs::create_directories(root_ / "etc/typhora/apps");
+    std::ofstream(root_ / "etc/typhora/apps" / (name + ".plist"))
+        << R"({"identifier": ")" << identifier << R"(", "executable": ")" << program.string()
+        << R"(", "sha256": ")" << digest.out.substr(0, 64) << R"(", "entitlements": {)"
+        << R"("com.zorvane.developer.user-fonts": )" << entitlements
+        << R"(}, "sandbox": {"readOnlyPaths": []}})";
+    return program.string();
+  }
+  CommandResult checkin(const std::string& program) {
+    return runCommand({program, "--runtime-dir", runtime_, "call", "checkin:"}, 20s);
+  }
+};
+
+TEST_F(CheckinProcessTest, EachApplicationGetsWhatItsEntitlementsOpen) {
+  const std::string browser = install("browser", "com.example.browser", R"(["font-enumeration"])");
+  const std::string shop = install("shop", "com.example.shop", R"(["system-installation"])");
+  startDaemon();
+
+  auto enumerated = checkin(browser);
+  ASSERT_EQ(enumerated.status, 0) << enumerated.all << daemon_->output();
+  EXPECT_THAT(enumerated.out, HasSubstr("com.example.shop/A.otf"));
+  EXPECT_THAT(enumerated.out, HasSubstr(R"("extension":{"$data":)"));
+  EXPECT_THAT(enumerated.out, Not(HasSubstr("hide-profilefonts")));
+
+  auto provided = checkin(shop);
+  ASSERT_EQ(provided.status, 0) << provided.all;
+  EXPECT_THAT(provided.out, HasSubstr("com.example.shop/A.otf"));
+  EXPECT_THAT(provided.out, HasSubstr(R"("extension.provider":{"$data":)"));
+  EXPECT_THAT(provided.out, HasSubstr(R"("hide-profilefonts":true)"));
+
+  // A program no manifest signs has no capability: an absent answer.
+  auto unsigned_ = ctl({"call", "checkin:"});
+  ASSERT_EQ(unsigned_.status, 0) << unsigned_.all;
+  EXPECT_EQ(unsigned_.out, "[null]\n");
+}
+
+}  // namespace
+}  // namespace typhora::testing
