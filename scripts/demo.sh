@@ -41,8 +41,10 @@ From another terminal, talk to it:
   $ctl plist show $demo_dir/root/var/mobile/Library/UserFonts/UserFonts.plist
   $ctl event watch                       # every notification posted
   $ctl event post --system com.example.ping
-  $demo_dir/apps/fontshop --runtime-dir $demo_dir/run call 'updatingUserFonts:'
-                                         # the same call, from a signed application
+  $demo_dir/apps/fontshop --runtime-dir $demo_dir/run call 'checkin:'
+                                         # a signed font provider checks in: its fonts and a
+                                         # token for its directory
+  $ctl call 'checkin:'                   # an unsigned program has no capability: [null]
 
 Starting typhorad in the foreground (Ctrl-C to stop)...
 MSG
