@@ -65,7 +65,6 @@ void TyphoraDaemon::setupForLumoService() {
 
 // Start-up steps whose subsystems arm nothing yet.
 void TyphoraDaemon::setupForScheduledFontDeletion() {}
-void TyphoraDaemon::setupForDistributedNotifications() {}
 void TyphoraDaemon::setupForMonitoringFontAssets() {}
 
 void TyphoraDaemon::setup() {

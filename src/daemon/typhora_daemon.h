@@ -52,6 +52,13 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   [[noreturn]] void run();
 
   SerialQueue& mainHandlerQueue() const { return *mainHandlerQueue_; }
+
+  // --- System event subscriptions (daemon/system_events.cc) ---
+
+  // Handles one event of the distributed-notification stream, on the main queue: removed
+  // applications lose their fonts and their ledger entries.
+  void handleDistributedNotification(const Value& event);
+  void synchronizeFontProviders();
   Platform& platform() const { return platform_; }
 
   // --- Font paths and the update queue (daemon/paths.cc) ---

@@ -11,6 +11,7 @@ namespace typhora::testing {
 namespace {
 
 using ::testing::HasSubstr;
+using ::testing::Not;
 
 class EventSocketTest : public DaemonTestBase {
  protected:
@@ -18,7 +19,8 @@ class EventSocketTest : public DaemonTestBase {
     DaemonTestBase::SetUp();
     fs::create_directories(root_ / "etc/typhora");
     std::ofstream(root_ / "etc/typhora/typhorad.launch.plist")
-        << R"({"LaunchEvents": {"systemNotification": ["com.example.ping"]},
+        << R"({"LaunchEvents": {"systemNotification": ["com.example.ping"],
+                 "distributedNotification": ["com.zorvane.Apploom.applicationUnregistered"]},
                "Activities": {"com.zorvane.typhorad.check-asset-update": {"Interval": 86400}}})";
   }
   // The event socket opens once the daemon has started up.
@@ -105,6 +107,22 @@ TEST_F(EventSocketTest, TheCatalogActivityDownloadsAndTheAssetServiceAnnouncesIt
               HasSubstr("com.zorvane.Cargell.ScrivaneAssets.cg.cached-metadata-updated"));
   EXPECT_TRUE(
       fs::exists(root_ / "var/typhora/assets/com.zorvane.Cargell.ScrivaneAssets/catalog.plist"));
+}
+
+TEST_F(EventSocketTest, ARemovedApplicationTakesItsFontsWithIt) {
+  const fs::path font = root_ / "var/mobile/Library/UserFonts/FontFiles/com.example.shop/A.otf";
+  fs::create_directories(font.parent_path());
+  std::ofstream(font) << "font";
+  startDaemonAndEvents();
+  auto posted =
+      ctl({"event", "post", "--distributed", "com.zorvane.Apploom.applicationUnregistered",
+           R"({"bundleIDs": ["com.example.shop"]})"});
+  ASSERT_EQ(posted.status, 0) << posted.all;
+  ASSERT_TRUE(daemon_->waitForLine("synchroning FontProviders", 10s)) << daemon_->output();
+  EXPECT_FALSE(fs::exists(font.parent_path()));
+  auto info =
+      ctl({"plist", "show", (root_ / "var/mobile/Library/UserFonts/UserFonts.plist").string()});
+  EXPECT_THAT(info.out, Not(HasSubstr("com.example.shop")));
 }
 
 TEST_F(EventSocketTest, AnEventStartsTheDaemonThroughSocketActivation) {
