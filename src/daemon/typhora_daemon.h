@@ -146,6 +146,14 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   // IPC: forgets `identifier`'s entry when the caller holds the reset entitlement; always replies.
   void resetIssuedFontsFor(const std::string& identifier, const IpcReply& reply);
 
+  // --- Font files and assets: asset synchronisation (maintenance/font_assets.cc) ---
+
+  // IPC: the registry's information on the mirrored copies of the named asset-store files,
+  // synchronising first when fewer are mirrored than named, and a token for the mirror.
+  void synchronizeFontAssets(const std::vector<std::string>& paths, const IpcReply& reply);
+  // The process-wide queue that watches the asset store (made on first use, never released).
+  static std::shared_ptr<SerialQueue> fontAssetsMonitorQueue();
+
   // --- Font files and assets: the asset catalog (maintenance/asset_catalog.cc) ---
 
   // The block list's loading queue, made on first use and kept for the process.

@@ -108,6 +108,7 @@ TEST_F(DaemonTest, ConnectionsAreServedWhileStartUpStillRuns) {
   EXPECT_EQ(fake.fileSystem.reads(kUserFontsPath), 1);
   EXPECT_TRUE(daemon->isUserFontInstalled());
   client->invalidate();
+  TyphoraDaemon::fontAssetsMonitorQueue()->sync([] {});  // asset monitoring has started
 }
 
 TEST_F(DaemonTest, EachConnectionGetsItsOwnHandlerWhichGoesWithIt) {
@@ -147,9 +148,8 @@ TEST_F(DaemonTest, OperationsReachTheDaemonOnlyWhenItCarriesThemOut) {
   // A daemon operation, sent without any check-in.
   EXPECT_TRUE(client->deliver(op::kUpdatingUserFonts, {}).reply.has_value());
   // Operations of the interface not carried out yet are refused as unrecognised.
-  for (const char* name : {op::kFontChanged, op::kSynchronizeFontAssets}) {
-    auto refused = client->deliver(
-        name, {name == op::kFontChanged ? Value(Dictionary()) : Value(ValueArray{})});
+  for (const char* name : {op::kFontChanged}) {
+    auto refused = client->deliver(name, {Value(Dictionary())});
     EXPECT_FALSE(refused.accepted) << name;
     EXPECT_FALSE(refused.reply.has_value()) << name;
   }
