@@ -19,6 +19,9 @@ namespace {
 constexpr const char* kUserFontsInfo = "/var/mobile/Library/UserFonts/UserFonts.plist";
 constexpr const char* kProfileFontsInfo = "/var/mobile/Library/UserFonts/ProfileFonts.plist";
 constexpr const char* kProviders = "/var/mobile/Library/UserFonts/FontProviders.plist";
+// The mirror paths whose records the user-fonts file holds, written after it: when the asset
+// store still matches it, a synchronisation has nothing to do and need not read the big file.
+constexpr const char* kMirrorIndex = "/var/mobile/Library/UserFonts/FontAssets.plist";
 constexpr const char* kFontFiles = "/var/mobile/Library/UserFonts/FontFiles/";
 constexpr const char* kFontAssets = "/var/mobile/Library/UserFonts/FontAssets/";
 constexpr const char* kAssetStore = "/private/var/Cargell/AssetsV2/com_zorvane_Cargell_Font6/";
@@ -177,6 +180,11 @@ bool LinuxUserFontManager::mirrorAssetsLocked() {
             it->path().string();
     }
   }
+  ValueArray index;
+  for (const auto& [mirror, store] : wanted) index.emplace_back(mirror);
+  const Value wantedIndex(std::move(index));
+  if (PlistReader::readFile(root_.onDisk(kMirrorIndex), {}, nullptr) == wantedIndex) return true;
+
   bool ok = true;
   std::vector<DictionaryEntry> entries = entriesOf(userFontsInfo());
   std::map<std::string, Value> kept;
@@ -218,12 +226,15 @@ bool LinuxUserFontManager::mirrorAssetsLocked() {
     if (!stillWanted) fs::remove_all(root_.onDisk(prefix), ec);
   }
   Value info(Dictionary(std::vector<DictionaryEntry>(kept.begin(), kept.end())));
-  if (info == userFontsInfo()) return ok;
   std::string error;
-  if (!writeInfoLocked(info, &error)) {
+  if (info != Value(Dictionary(std::move(entries))) && !writeInfoLocked(info, &error)) {
     TYLog_Error(kTYLogTyphoraDaemon, "font registry: cannot write %@: %@", kUserFontsInfo, error);
     return false;
   }
+  // Only a complete mirror is recorded: a failed file is retried by the next synchronisation.
+  if (ok && !AtomicFile::write(root_.onDisk(kMirrorIndex), CborCodec::encode(wantedIndex), 0644,
+                               &error))
+    TYLog_Error(kTYLogTyphoraDaemon, "font registry: cannot write %@: %@", kMirrorIndex, error);
   return ok;
 }
 
