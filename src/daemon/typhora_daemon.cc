@@ -64,7 +64,6 @@ void TyphoraDaemon::setupForLumoService() {
 }
 
 // Start-up steps whose subsystems arm nothing yet.
-void TyphoraDaemon::setupForScheduledFontDeletion() {}
 
 void TyphoraDaemon::setup() {
   if (storedVersion(platform_.preferences.value(kVersionKey)) > 0) return;

@@ -11,6 +11,7 @@
 #include <vector>
 
 #include "platform/ipc_listener.h"
+#include "platform/one_shot_timer.h"
 #include "platform/platform.h"
 #include "platform/serial_queue.h"
 #include "platform/value.h"
@@ -146,6 +147,19 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   // IPC: forgets `identifier`'s entry when the caller holds the reset entitlement; always replies.
   void resetIssuedFontsFor(const std::string& identifier, const IpcReply& reply);
 
+  // --- Font files and assets: scheduled deletion (maintenance/scheduled_deletion.cc) ---
+
+  // The deletion queue (process-wide, made on first use); every change to the pending table
+  // "delete" and to the timer happens on it.
+  SerialQueue& scheduledFontDeletionQueue();
+  // The deletion timer, or null; read it on the deletion queue.
+  std::shared_ptr<OneShotTimer> scheduledFontDeletionTimer() const;
+  // IPC, one-way: schedules font files for deletion after the delay.
+  void scheduleFontFilesDeletion(const std::vector<std::string>& paths);
+  void setFontFilesDeletionTimer(std::uint32_t seconds);
+  void stopFontFilesDeletionTimer();
+  void executeScheduledFontFilesDeletion(const std::shared_ptr<OneShotTimer>& timer);
+
   // --- Font files and assets: asset synchronisation (maintenance/font_assets.cc) ---
 
   // IPC: the registry's information on the mirrored copies of the named asset-store files,
@@ -189,6 +203,9 @@ class TyphoraDaemon final : public IpcListenerDelegate,
 
   // Serialises the ledger's read-modify-write of "issues" across the queues that reach it.
   std::mutex ledgerMutex_;
+
+  // The deletion timer: touched only on scheduledFontDeletionQueue.
+  std::shared_ptr<OneShotTimer> scheduledFontDeletionTimer_;
 
   std::once_flag updateQueueOnce_;
   std::shared_ptr<SerialQueue> updateQueue_;

@@ -28,6 +28,13 @@ bool TyphoraDaemon::forwardInvocation(const IpcOperation& operation,
     updatingUserFonts([&reply] { reply({}); });
     return true;
   }
+  if (name == op::kScheduleFontFilesDeletion) {
+    std::vector<std::string> paths;
+    for (const Value& item : *arguments.at(0).asArray())
+      if (const std::string* path = item.asString()) paths.push_back(*path);
+    scheduleFontFilesDeletion(paths);
+    return true;
+  }
   if (name == op::kSynchronizeFontAssets) {
     std::vector<std::string> paths;
     for (const Value& item : *arguments.at(0).asArray())

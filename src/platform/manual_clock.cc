@@ -7,6 +7,7 @@ namespace typhora {
 
 struct ManualClock::Alarm final : ClockAlarm {
   Duration deadline{0};
+  Duration leeway{0};
   std::uint64_t sequence = 0;
   std::function<void()> fire;
   std::atomic<bool> cancelled{false};
@@ -25,10 +26,11 @@ Duration ManualClock::uptime() const {
   return uptime_;
 }
 
-std::shared_ptr<ClockAlarm> ManualClock::schedule(Duration delay, Duration /*leeway*/,
+std::shared_ptr<ClockAlarm> ManualClock::schedule(Duration delay, Duration leeway,
                                                   std::function<void()> fire) {
   auto alarm = std::make_shared<Alarm>();
   alarm->fire = std::move(fire);
+  alarm->leeway = leeway;
   std::lock_guard lock(mutex_);
   alarm->deadline = uptime_ + std::max(delay, Duration::zero());
   alarm->sequence = nextSequence_++;
@@ -74,6 +76,15 @@ std::optional<Duration> ManualClock::nextDeadline() const {
     if (!a->cancelled && (!next || a->deadline < *next)) next = a->deadline;
   }
   return next;
+}
+
+std::optional<Duration> ManualClock::nextLeeway() const {
+  std::lock_guard lock(mutex_);
+  const Alarm* next = nullptr;
+  for (const auto& a : alarms_) {
+    if (!a->cancelled && (next == nullptr || a->deadline < next->deadline)) next = a.get();
+  }
+  return next != nullptr ? std::optional(next->leeway) : std::nullopt;
 }
 
 }  // namespace typhora

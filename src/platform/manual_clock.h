@@ -24,6 +24,8 @@ class ManualClock final : public Clock {
   std::size_t pendingAlarms() const;
   // Deadline (as uptime) of the earliest pending alarm, if any.
   std::optional<Duration> nextDeadline() const;
+  // The leeway the earliest pending alarm was scheduled with.
+  std::optional<Duration> nextLeeway() const;
 
  private:
   struct Alarm;

@@ -7,6 +7,10 @@ namespace typhora::testing {
 void FakeFileSystem::writeFile(const std::string& path, std::string contents) {
   std::lock_guard lock(mutex_);
   files_[path] = std::move(contents);
+  // Like a real file system, the directories on the way stay when the file goes.
+  for (std::size_t slash = path.find('/', 1); slash != std::string::npos;
+       slash = path.find('/', slash + 1))
+    directories_.insert(path.substr(0, slash));
 }
 
 void FakeFileSystem::removeFile(const std::string& path) {
