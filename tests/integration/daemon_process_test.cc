@@ -65,6 +65,22 @@ TEST_F(DaemonProcessTest, RefusedOperationsLeaveTheDaemonServing) {
   EXPECT_EQ(ok.status, 0) << ok.all << daemon_->output();
 }
 
+TEST_F(DaemonProcessTest, ScheduledFontFilesAreDeletedWhenDue) {
+  const fs::path font = root_ / "var/mobile/Library/UserFonts/FontFiles/com.example.shop/A.otf";
+  fs::create_directories(font.parent_path());
+  std::ofstream(font) << "font";
+  fs::create_directories(root_ / "var/mobile/Library/Preferences");
+  std::ofstream(root_ / "var/mobile/Library/Preferences/com.zorvane.typhorad.plist")
+      << R"({"version": 1, "deleteDelay": 0.5})";  // under a second: due at once
+  startDaemon();
+  auto scheduled = ctl({"call", "scheduleFontFilesDeletion:",
+                        R"(["/var/mobile/Library/UserFonts/FontFiles/com.example.shop/A.otf"])"});
+  ASSERT_EQ(scheduled.status, 0) << scheduled.all;
+  EXPECT_EQ(scheduled.out, "[]\n");
+  ASSERT_TRUE(daemon_->waitForLine("all files deleted.", 10s)) << daemon_->output();
+  EXPECT_FALSE(fs::exists(font.parent_path()));
+}
+
 TEST_F(DaemonProcessTest, StartsThroughSocketActivation) {
   const std::string socket = (runtime_ / kService).string();
   std::vector<std::string> argv = {"/usr/bin/systemd-socket-activate", "-l", socket,

@@ -1,11 +1,13 @@
 #include "client_command.h"
 
+#include <chrono>
 #include <iostream>
 #include <memory>
 
 #include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
 #include "platform/json_codec.h"
+#include "platform/linux/lumo_connection.h"
 #include "platform/linux/lumo_service.h"
 
 namespace typhora::ctl {
@@ -40,16 +42,24 @@ CallResult callService(const ClientOptions& options, std::shared_ptr<const IpcIn
                        const std::string& wireName, std::vector<Value> arguments) {
   LumoService service(options.runtimeDir);
   auto connection = service.connectToService(kServiceName);
-  connection->setRemoteInterface(std::move(remote));
+  connection->setRemoteInterface(remote);
   connection->resume();
 
   CallResult result;
+  const IpcOperation* operation = remote->find(wireName);
   auto proxy = connection->synchronousRemoteObjectProxy(
       [&result](const std::string& error) { result.error = error; });
   proxy->call(wireName, std::move(arguments), [&result](std::vector<Value> reply) {
     result.ok = true;
     result.reply = std::move(reply);
   });
+  // A one-way operation has no reply: it succeeded once it has left.
+  if (operation != nullptr && !operation->replies && result.error.empty()) {
+    auto lumo = std::dynamic_pointer_cast<LumoConnection>(connection);
+    result.ok =
+        lumo == nullptr || lumo->waitUntilSent(std::chrono::seconds(options.timeoutSeconds));
+    if (!result.ok) result.error = "the message could not be sent";
+  }
   connection->invalidate();
   return result;
 }
