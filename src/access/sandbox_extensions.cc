@@ -19,15 +19,6 @@ Value tokenValue(const std::string& token) {
   return Value(std::move(bytes));
 }
 
-// The name of the directory that directly holds `path`.
-std::string_view containingDirectoryName(std::string_view path) {
-  const std::size_t last = path.rfind('/');
-  if (last == std::string_view::npos) return {};
-  const std::string_view directory = path.substr(0, last);
-  const std::size_t before = directory.rfind('/');
-  return before == std::string_view::npos ? directory : directory.substr(before + 1);
-}
-
 bool isDisabled(const Value& record) {
   return record.get("disabled").asBool() == true;
 }

@@ -75,4 +75,12 @@ void TyphoraDaemon::updatingUserFonts(const std::function<void()>& reply) {
   });
 }
 
+std::string_view containingDirectoryName(std::string_view path) {
+  const std::size_t last = path.rfind('/');
+  if (last == std::string_view::npos) return {};
+  const std::string_view directory = path.substr(0, last);
+  const std::size_t before = directory.rfind('/');
+  return before == std::string_view::npos ? directory : directory.substr(before + 1);
+}
+
 }  // namespace typhora

@@ -22,6 +22,10 @@ bool isFontFilePath(std::string_view path);
 bool isFontAssetPath(std::string_view path);
 bool isAssetStorePath(std::string_view path);
 
+// The name of the directory that directly holds the file at `path` (its last component after the
+// path's own last component is removed).
+std::string_view containingDirectoryName(std::string_view path);
+
 // What a file URL's path makes of a directory path: "." and empty components dropped, ".."
 // folded, no trailing separator. Links are not resolved.
 std::string normalisedDirectoryPath(std::string_view path);

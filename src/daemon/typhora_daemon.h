@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "ipc/local_notification_center.h"
 #include "platform/ipc_listener.h"
 #include "platform/one_shot_timer.h"
 #include "platform/platform.h"
@@ -77,6 +78,9 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   // the operation: the call is then refused as unrecognised.
   bool forwardInvocation(const IpcOperation& operation, const std::vector<Value>& arguments,
                          const IpcReply& reply);
+  // IPC: the registry reports changed fonts; every checked-in client is told what it may see.
+  void fontChanged(const Value& change, const IpcReply& reply);
+  LocalNotificationCenter& localNotificationCenter() { return localNotificationCenter_; }
 
   // --- Font catalog: the user-fonts information (catalog/user_fonts_store.cc) ---
 
@@ -203,6 +207,8 @@ class TyphoraDaemon final : public IpcListenerDelegate,
 
   // Serialises the ledger's read-modify-write of "issues" across the queues that reach it.
   std::mutex ledgerMutex_;
+
+  LocalNotificationCenter localNotificationCenter_;
 
   // The deletion timer: touched only on scheduledFontDeletionQueue.
   std::shared_ptr<OneShotTimer> scheduledFontDeletionTimer_;

@@ -28,6 +28,10 @@ bool TyphoraDaemon::forwardInvocation(const IpcOperation& operation,
     updatingUserFonts([&reply] { reply({}); });
     return true;
   }
+  if (name == op::kFontChanged) {
+    fontChanged(arguments.at(0), reply);
+    return true;
+  }
   if (name == op::kScheduleFontFilesDeletion) {
     std::vector<std::string> paths;
     for (const Value& item : *arguments.at(0).asArray())

@@ -18,6 +18,7 @@ TyphoraHandler::TyphoraHandler(std::shared_ptr<TyphoraDaemon> server)
     : server_(std::move(server)) {}
 
 TyphoraHandler::~TyphoraHandler() {
+  server_->localNotificationCenter().removeObserver(this);
   TYLog_Debug(kTYLogTyphoraDaemon, kHandlerDeallocated);
 }
 
@@ -59,6 +60,7 @@ void TyphoraHandler::checkin(const IpcReply& reply) {
     reply({Value()});
     return;
   }
+  observeFontChanges();
   server_->setupUserInstalledFontsFor(token, token, enumeration, fontAccess, provider, identifier,
                                       reply);
   if (provider) {

@@ -29,6 +29,10 @@ class TyphoraHandler final : public IpcExportedObject,
   void checkin(const IpcReply& reply);
   void checkinForFontPicker(const IpcReply& reply);
 
+  // Font changes, on mainHandlerQueue, for handlers registered by checkin
+  // (ipc/font_change_fanout.cc): the client is sent what it may see of the change.
+  void fontChanged(const Value& change);
+
   // True exactly for the font-registry library's own process identifier (case-sensitive).
   static bool isProcessIdentifierToIgnore(const std::string* identifier);
 
@@ -45,6 +49,10 @@ class TyphoraHandler final : public IpcExportedObject,
   std::vector<std::shared_ptr<IpcConnection>> webcontentProcessConnections() const;
 
  private:
+  void observeFontChanges();
+  void userFontsChanged(bool added, const ValueArray& urls);
+  void profileFontsChanged(bool added, const ValueArray& urls);
+
   // The fields are written on the connection's thread and read from mainHandlerQueue and from
   // invalidation handlers on other threads, so one mutex guards them all.
   mutable std::mutex mutex_;

@@ -148,11 +148,9 @@ TEST_F(DaemonTest, OperationsReachTheDaemonOnlyWhenItCarriesThemOut) {
   // A daemon operation, sent without any check-in.
   EXPECT_TRUE(client->deliver(op::kUpdatingUserFonts, {}).reply.has_value());
   // Operations of the interface not carried out yet are refused as unrecognised.
-  for (const char* name : {op::kFontChanged}) {
-    auto refused = client->deliver(name, {Value(Dictionary())});
-    EXPECT_FALSE(refused.accepted) << name;
-    EXPECT_FALSE(refused.reply.has_value()) << name;
-  }
+  auto refused = client->deliver(op::kRequestFontsForClient, {Value("com.a"), Value()});
+  EXPECT_FALSE(refused.accepted);
+  EXPECT_FALSE(refused.reply.has_value());
   EXPECT_FALSE(client->deliver(op::kRequestFonts, {Value(ValueArray{})}).accepted);
   // sendFonts:reply: is accepted and never answered.
   auto sent = client->deliver(op::kSendFonts, {Value(Dictionary())});

@@ -3,15 +3,27 @@
 namespace typhora::testing {
 namespace {
 
-// Calls through the fake reach nobody: they fail at once, as calls to a gone peer do.
-class UnreachableProxy final : public IpcRemoteProxy {
+// One-way calls that match the remote interface are recorded on the connection, as sent to a
+// peer that never answers; calls expecting a reply, or made once the connection is invalid, fail
+// at once as calls to a gone peer do.
+class RecordingProxy final : public IpcRemoteProxy {
  public:
-  explicit UnreachableProxy(IpcErrorHandler handler) : handler_(std::move(handler)) {}
-  void call(const std::string& wireName, std::vector<Value>, IpcReply) override {
-    if (handler_) handler_("no peer answers " + wireName + " on a fake connection");
+  RecordingProxy(FakeIpcConnection& connection, IpcErrorHandler handler)
+      : connection_(connection), handler_(std::move(handler)) {}
+  void call(const std::string& wireName, std::vector<Value> arguments, IpcReply) override {
+    std::string why;
+    auto remote = connection_.remoteInterface();
+    const IpcOperation* operation = remote ? remote->find(wireName) : nullptr;
+    if (operation == nullptr || !IpcInterface::matches(*operation, arguments, &why) ||
+        operation->replies || !connection_.isValid()) {
+      if (handler_) handler_("no peer answers " + wireName + " on a fake connection " + why);
+      return;
+    }
+    connection_.recordSent(wireName, std::move(arguments));
   }
 
  private:
+  FakeIpcConnection& connection_;
   IpcErrorHandler handler_;
 };
 
@@ -64,11 +76,21 @@ bool FakeIpcConnection::isValid() const {
 }
 
 std::shared_ptr<IpcRemoteProxy> FakeIpcConnection::remoteObjectProxy(IpcErrorHandler handler) {
-  return std::make_shared<UnreachableProxy>(std::move(handler));
+  return std::make_shared<RecordingProxy>(*this, std::move(handler));
 }
 std::shared_ptr<IpcRemoteProxy> FakeIpcConnection::synchronousRemoteObjectProxy(
     IpcErrorHandler handler) {
-  return std::make_shared<UnreachableProxy>(std::move(handler));
+  return std::make_shared<RecordingProxy>(*this, std::move(handler));
+}
+
+void FakeIpcConnection::recordSent(const std::string& wireName, std::vector<Value> arguments) {
+  std::lock_guard lock(mutex_);
+  sent_.push_back({wireName, std::move(arguments)});
+}
+
+std::vector<FakeIpcConnection::Sent> FakeIpcConnection::sent() const {
+  std::lock_guard lock(mutex_);
+  return sent_;
 }
 
 FakeIpcConnection::Delivery FakeIpcConnection::deliver(const std::string& wireName,

@@ -38,6 +38,14 @@ class FakeIpcConnection final : public IpcConnection {
   };
   Delivery deliver(const std::string& wireName, std::vector<Value> arguments);
 
+  // One-way calls made to the peer through remote proxies, in order.
+  struct Sent {
+    std::string wireName;
+    std::vector<Value> arguments;
+  };
+  std::vector<Sent> sent() const;
+  void recordSent(const std::string& wireName, std::vector<Value> arguments);
+
   bool resumed() const;
   std::shared_ptr<const IpcInterface> exportedInterface() const;
   std::shared_ptr<const IpcInterface> remoteInterface() const;
@@ -51,6 +59,7 @@ class FakeIpcConnection final : public IpcConnection {
   std::shared_ptr<const IpcInterface> remoteInterface_;
   std::function<void()> invalidationHandler_;
   std::function<void()> interruptionHandler_;
+  std::vector<Sent> sent_;
   bool resumed_ = false;
   bool valid_ = true;
 };
