@@ -24,6 +24,9 @@ class TyphoraHandler;
 inline constexpr const char* kServiceName = "com.zorvane.typhorad";
 inline constexpr const char* kMainHandlerQueueLabel = "com.zorvane.typhorad";
 inline constexpr const char* kUpdatingUserFontsQueueLabel = "com.zorvane.typhora.UpdatingUserFonts";
+// The keys of a font request record: a family name, a PostScript name, or both.
+inline constexpr const char* kSVFontFamilyNameAttribute = "SVFontFamilyAttribute";
+inline constexpr const char* kSVFontNameAttribute = "SVFontNameAttribute";
 
 class TyphoraDaemon final : public IpcListenerDelegate,
                             public std::enable_shared_from_this<TyphoraDaemon> {
@@ -95,6 +98,23 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   Value _userFontsInfoFromDisk();
   // The daemon's path of the user-fonts file.
   static std::string userFontsFilePath();
+
+  // --- Font catalog: name resolution (catalog/name_resolution.cc) ---
+  // Every look-up walks the cached user-fonts information in its order (by path); names are
+  // compared exactly.
+
+  bool isKnownFamilyName(const std::string& familyName, bool* withEnabledState);
+  std::optional<std::string> knownFamilyNameFromPostScriptName(const std::string& postScriptName,
+                                                               bool* withEnabledState);
+  // Sorts request records into enabled and disabled families and answers the unknown names,
+  // sorted. Either out-argument may be null.
+  std::vector<std::string> unknownFontNamesAndEnabledFamilyNames(
+      std::vector<std::string>* enabledFamilyNames,
+      std::vector<std::string>* andDisabledFamilyNames, const ValueArray& fromRequests);
+  std::optional<std::string> identifierFromFilePath(const std::string& path);
+  std::set<std::string> providerIdentifiersFromFamilyName(const std::string& familyName);
+  std::set<std::string> providerIdentifiersAndFamilyName(std::optional<std::string>* familyName,
+                                                         const std::string& fromPostScriptName);
 
   // --- Access control: capabilities (access/capabilities.cc) ---
 
