@@ -116,6 +116,15 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   std::set<std::string> providerIdentifiersAndFamilyName(std::optional<std::string>* familyName,
                                                          const std::string& fromPostScriptName);
 
+  // --- Font requests: analytics (requests/request_analytics.cc) ---
+
+  void analyticsEventRequestFonts(const std::string& identifier, std::uint64_t misses,
+                                  std::uint64_t suggestions, std::uint64_t resolved);
+  // Counts a request in the persistent counters "missed" and "resolved".
+  void recordRequestFontsResultWihtMissed(bool missed, bool andResolved);
+  // Hands back both counters and resets them.
+  void extractRequestFontsMissed(std::uint64_t* missed, std::uint64_t* andResolved);
+
   // --- Access control: capabilities (access/capabilities.cc) ---
 
   // The caller's capabilities from its signing record; all four out-arguments are always written
@@ -225,6 +234,8 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   // Only keeps the service listener open for the life of the process; nothing reads it.
   std::shared_ptr<IpcListener> listener_;
 
+  // Serialises the counters' read-modify-write ("missed", "resolved").
+  std::mutex requestCountersMutex_;
   // Serialises the ledger's read-modify-write of "issues" across the queues that reach it.
   std::mutex ledgerMutex_;
 
