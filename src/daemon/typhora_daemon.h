@@ -20,6 +20,7 @@
 namespace typhora {
 
 class TyphoraHandler;
+class MissingFontsDialogHandler;
 
 inline constexpr const char* kServiceName = "com.zorvane.typhorad";
 inline constexpr const char* kMainHandlerQueueLabel = "com.zorvane.typhorad";
@@ -115,6 +116,17 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   std::set<std::string> providerIdentifiersFromFamilyName(const std::string& familyName);
   std::set<std::string> providerIdentifiersAndFamilyName(std::optional<std::string>* familyName,
                                                          const std::string& fromPostScriptName);
+
+  // --- Font requests: the missing-fonts dialog (requests/missing_fonts_dialog.cc) ---
+
+  ValueArray missingFontsDialogRequestsFromUnknownFontNames(const std::vector<std::string>& names);
+  ValueArray missingFontsDialogRequestsFromDisabledFamilyNames(
+      const std::vector<std::string>& familyNames);
+  // Presents the dialog when process `forPID` is in the foreground; otherwise the completion runs
+  // at once with an empty answer. Runs on mainHandlerQueue and does not wait for the user.
+  void showDialog(const ValueArray& items, std::int32_t forPID,
+                  std::function<void(const ValueArray& answer)> completionHandler);
+  std::shared_ptr<MissingFontsDialogHandler> missingFontsDialogHandler() const;
 
   // --- Font requests: analytics (requests/request_analytics.cc) ---
 
@@ -240,6 +252,8 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   std::mutex ledgerMutex_;
 
   LocalNotificationCenter localNotificationCenter_;
+  // The most recent dialog's handler; replaced on mainHandlerQueue by the next dialog.
+  std::shared_ptr<MissingFontsDialogHandler> missingFontsDialogHandler_;
 
   // The deletion timer: touched only on scheduledFontDeletionQueue.
   std::shared_ptr<OneShotTimer> scheduledFontDeletionTimer_;

@@ -46,7 +46,9 @@ std::shared_ptr<IpcListener> FakeIpcService::makeNamedListener(const std::string
 }
 
 std::shared_ptr<IpcListener> FakeIpcService::makeAnonymousListener() {
-  return std::make_shared<FakeIpcListener>();
+  auto listener = std::make_shared<FakeIpcListener>();
+  listener->makeAnonymous();
+  return listener;
 }
 
 std::shared_ptr<IpcConnection> FakeIpcService::connect(std::shared_ptr<const IpcEndpoint>) {

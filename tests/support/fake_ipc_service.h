@@ -12,12 +12,29 @@
 
 namespace typhora::testing {
 
-class FakeIpcListener final : public IpcListener {
+class FakeIpcListener;
+
+// The endpoint of a fake anonymous listener: it leads the test to that listener.
+class FakeIpcEndpoint final : public IpcEndpoint {
+ public:
+  explicit FakeIpcEndpoint(std::weak_ptr<FakeIpcListener> listener)
+      : listener_(std::move(listener)) {}
+  std::shared_ptr<FakeIpcListener> listener() const { return listener_.lock(); }
+  std::string description() const override { return "<fake endpoint>"; }
+
+ private:
+  std::weak_ptr<FakeIpcListener> listener_;
+};
+
+class FakeIpcListener final : public IpcListener,
+                              public std::enable_shared_from_this<FakeIpcListener> {
  public:
   void setDelegate(std::weak_ptr<IpcListenerDelegate> delegate) override;
   void resume() override;
   void invalidate() override;
-  std::shared_ptr<const IpcEndpoint> endpoint() const override { return nullptr; }
+  // An anonymous listener's endpoint; null for a named one.
+  std::shared_ptr<const IpcEndpoint> endpoint() const override { return endpoint_; }
+  void makeAnonymous() { endpoint_ = std::make_shared<FakeIpcEndpoint>(weak_from_this()); }
 
   bool resumed() const;
   // A new client connection offered to the delegate; null when refused or not resumed.
@@ -27,6 +44,7 @@ class FakeIpcListener final : public IpcListener {
   mutable std::mutex mutex_;
   std::weak_ptr<IpcListenerDelegate> delegate_;
   bool resumed_ = false;
+  std::shared_ptr<const IpcEndpoint> endpoint_;
 };
 
 class FakeIpcService final : public IpcService {
