@@ -103,6 +103,7 @@ TEST_F(EventSocketTest, TheCatalogActivityDownloadsAndTheAssetServiceAnnouncesIt
   ASSERT_EQ(run.status, 0) << run.all << daemon_->output();
   ASSERT_TRUE(daemon_->waitForLine("asset catalog updated. (0)", 10s)) << daemon_->output();
   ASSERT_EQ(watcher.waitFor(10s), 0) << watcher.output();
+  watcher.finishOutput();
   EXPECT_THAT(watcher.output(),
               HasSubstr("com.zorvane.Cargell.ScrivaneAssets.cg.cached-metadata-updated"));
   EXPECT_TRUE(
