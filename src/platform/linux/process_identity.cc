@@ -1,26 +1,34 @@
 #include "platform/linux/process_identity.h"
 
+#include <fcntl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <fstream>
+#include <cerrno>
+#include <charconv>
 #include <sstream>
+
+#include "platform/linux/unique_fd.h"
 
 namespace typhora {
 namespace {
 
 std::optional<std::uint64_t> startTimeOf(pid_t pid) {
-  std::ifstream stat("/proc/" + std::to_string(pid) + "/stat");
-  std::string content((std::istreambuf_iterator<char>(stat)), std::istreambuf_iterator<char>());
+  std::optional<std::string> content = ProcessIdentity::readProcessFile(pid, "stat");
+  if (!content) return std::nullopt;
   // The command name may hold spaces and parentheses: fields start after the last ')'.
-  std::size_t close = content.rfind(')');
-  if (close == std::string::npos) return std::nullopt;
-  std::istringstream fields(content.substr(close + 2));
+  std::size_t close = content->rfind(')');
+  if (close == std::string::npos || close + 2 > content->size()) return std::nullopt;
+  std::istringstream fields(content->substr(close + 2));
   std::string field;
   // Field 3 (state) is the first after the name; the start time is field 22.
   for (int index = 3; fields >> field; ++index) {
-    if (index == 22) return std::stoull(field);
+    if (index != 22) continue;
+    std::uint64_t start = 0;
+    auto [end, error] = std::from_chars(field.data(), field.data() + field.size(), start);
+    if (error != std::errc() || end != field.data() + field.size()) return std::nullopt;
+    return start;
   }
   return std::nullopt;
 }
@@ -34,6 +42,22 @@ bool executableOf(pid_t pid, std::uint64_t* device, std::uint64_t* inode) {
 }
 
 }  // namespace
+
+std::optional<std::string> ProcessIdentity::readProcessFile(pid_t pid, const char* name) {
+  // Plain reads: a process that ends while its file is read makes the read fail (ESRCH), which
+  // must be an answer here, never an exception.
+  UniqueFd fd(open(("/proc/" + std::to_string(pid) + "/" + name).c_str(), O_RDONLY | O_CLOEXEC));
+  if (!fd.valid()) return std::nullopt;
+  std::string content;
+  char buffer[4096];
+  for (;;) {
+    ssize_t n = read(fd.get(), buffer, sizeof buffer);
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) return std::nullopt;
+    if (n == 0) return content;
+    content.append(buffer, static_cast<std::size_t>(n));
+  }
+}
 
 AuditToken ProcessIdentity::ofProcess(pid_t pid, uid_t uid, gid_t gid) {
   AuditToken token;

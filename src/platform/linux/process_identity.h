@@ -18,6 +18,8 @@ class ProcessIdentity {
   // False for the zero token, a process that has gone, a reused pid, or a process that has
   // exec'd another program since the token was taken.
   static bool isValid(const AuditToken& token);
+  // The contents of /proc/<pid>/<name>; nullopt when it cannot be read (the process has gone).
+  static std::optional<std::string> readProcessFile(pid_t pid, const char* name);
   // The executable the token's process runs, when the token is still valid.
   static std::optional<std::string> executablePath(const AuditToken& token);
 };

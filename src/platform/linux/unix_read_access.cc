@@ -3,14 +3,15 @@
 #include <sys/stat.h>
 
 #include <algorithm>
-#include <fstream>
 #include <sstream>
+
+#include "platform/linux/process_identity.h"
 
 namespace typhora {
 
 UnixCredentials UnixCredentials::ofProcess(pid_t pid, uid_t uid, gid_t gid) {
   UnixCredentials credentials{uid, {gid}};
-  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+  std::istringstream status(ProcessIdentity::readProcessFile(pid, "status").value_or(""));
   std::string line;
   while (std::getline(status, line)) {
     if (!line.starts_with("Groups:")) continue;
