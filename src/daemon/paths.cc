@@ -75,10 +75,13 @@ void TyphoraDaemon::updatingUserFonts(const std::function<void()>& reply) {
   });
 }
 
-std::string_view containingDirectoryName(std::string_view path) {
+std::string_view parentDirectoryPath(std::string_view path) {
   const std::size_t last = path.rfind('/');
-  if (last == std::string_view::npos) return {};
-  const std::string_view directory = path.substr(0, last);
+  return last == std::string_view::npos ? std::string_view() : path.substr(0, last);
+}
+
+std::string_view containingDirectoryName(std::string_view path) {
+  const std::string_view directory = parentDirectoryPath(path);
   const std::size_t before = directory.rfind('/');
   return before == std::string_view::npos ? directory : directory.substr(before + 1);
 }

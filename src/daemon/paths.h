@@ -22,6 +22,8 @@ bool isFontFilePath(std::string_view path);
 bool isFontAssetPath(std::string_view path);
 bool isAssetStorePath(std::string_view path);
 
+// The path of the directory that holds the file at `path` (the path without its last component).
+std::string_view parentDirectoryPath(std::string_view path);
 // The name of the directory that directly holds the file at `path` (its last component after the
 // path's own last component is removed).
 std::string_view containingDirectoryName(std::string_view path);

@@ -6,6 +6,18 @@
 #include "ipc/typhora_handler.h"
 
 namespace typhora {
+namespace {
+
+// The strings of an array argument (the interface has checked that it is an array); elements of
+// other types are not paths and are left out.
+std::vector<std::string> stringsOf(const Value& array) {
+  std::vector<std::string> strings;
+  for (const Value& item : *array.asArray())
+    if (const std::string* text = item.asString()) strings.push_back(*text);
+  return strings;
+}
+
+}  // namespace
 
 bool TyphoraDaemon::shouldAcceptNewConnection(IpcListener& /*listener*/,
                                               std::shared_ptr<IpcConnection> connection) {
@@ -33,17 +45,11 @@ bool TyphoraDaemon::forwardInvocation(const IpcOperation& operation,
     return true;
   }
   if (name == op::kScheduleFontFilesDeletion) {
-    std::vector<std::string> paths;
-    for (const Value& item : *arguments.at(0).asArray())
-      if (const std::string* path = item.asString()) paths.push_back(*path);
-    scheduleFontFilesDeletion(paths);
+    scheduleFontFilesDeletion(stringsOf(arguments.at(0)));
     return true;
   }
   if (name == op::kSynchronizeFontAssets) {
-    std::vector<std::string> paths;
-    for (const Value& item : *arguments.at(0).asArray())
-      if (const std::string* path = item.asString()) paths.push_back(*path);
-    synchronizeFontAssets(paths, reply);
+    synchronizeFontAssets(stringsOf(arguments.at(0)), reply);
     return true;
   }
   if (name == op::kResetIssuedFontsFor) {

@@ -19,20 +19,10 @@ constexpr const char* kEventStreamCallback = "FontAssetsEventStreamCallback - %@
 constexpr const char* kSynchronizeResult = "synchronizeFontAssets result - %s";
 constexpr std::string_view kAssetData = "AssetData";
 
-// The last component of the directory holding `path` (and that directory's own path).
-std::string_view parentName(std::string_view path, std::string_view* parent = nullptr) {
-  const std::size_t slash = path.rfind('/');
-  const std::string_view directory = slash == std::string_view::npos ? "" : path.substr(0, slash);
-  if (parent != nullptr) *parent = directory;
-  const std::size_t before = directory.rfind('/');
-  return before == std::string_view::npos ? directory : directory.substr(before + 1);
-}
-
 // The asset name of an asset-store font file ("<store>/<asset>/AssetData/<file>"), or empty.
 std::string_view assetNameOfStoreFile(std::string_view path) {
-  std::string_view assetData;
-  if (!isAssetStorePath(path) || parentName(path, &assetData) != kAssetData) return {};
-  return parentName(assetData);
+  if (!isAssetStorePath(path) || containingDirectoryName(path) != kAssetData) return {};
+  return containingDirectoryName(parentDirectoryPath(path));
 }
 
 // The asset store's event stream, kept for the life of the process; touched only on the
@@ -108,7 +98,7 @@ void TyphoraDaemon::synchronizeFontAssets(const std::vector<std::string>& paths,
       const Value info = self->platform_.fontManager.userFontsInfo();
       if (const Dictionary* all = info.asDictionary()) {
         for (const auto& [path, entry] : all->entries()) {
-          if (isFontAssetPath(path) && named->contains(std::string(parentName(path))))
+          if (isFontAssetPath(path) && named->contains(std::string(containingDirectoryName(path))))
             entries.emplace_back(path, entry);
         }
       }

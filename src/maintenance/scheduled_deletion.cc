@@ -36,16 +36,6 @@ std::uint32_t truncatedSeconds(double seconds) {
   return static_cast<std::uint32_t>(seconds);
 }
 
-std::string_view parentDirectory(std::string_view path) {
-  const std::size_t slash = path.rfind('/');
-  return slash == std::string_view::npos ? std::string_view() : path.substr(0, slash);
-}
-
-std::string_view lastComponent(std::string_view path) {
-  const std::size_t slash = path.rfind('/');
-  return slash == std::string_view::npos ? path : path.substr(slash + 1);
-}
-
 std::vector<DictionaryEntry> tableEntries(const Value& table) {
   const Dictionary* entries = table.asDictionary();
   return entries != nullptr ? entries->entries() : std::vector<DictionaryEntry>{};
@@ -153,11 +143,11 @@ void TyphoraDaemon::executeScheduledFontFilesDeletion(
     TYLog_Debug(kTYLogTyphoraDaemon, kScheduledDeletion, static_cast<int>(due.size()));
     std::set<std::string> directories;
     for (const std::string& path : due) {
-      directories.emplace(parentDirectory(path));
+      directories.emplace(parentDirectoryPath(path));
       // A mirrored asset file stays while its asset is still installed.
       if (isFontAssetPath(path) &&
           platform_.fileSystem.fileExists(std::string(kAssetStoreDirectory) +
-                                          std::string(lastComponent(parentDirectory(path)))))
+                                          std::string(containingDirectoryName(path))))
         continue;
       std::string error;
       if (!platform_.fileSystem.removeItem(path, &error))

@@ -14,6 +14,12 @@ class DeviceRoot {
   }
   // The machine path of the daemon's absolute path `path`.
   std::string onDisk(std::string_view path) const { return prefix_ + std::string(path); }
+  // Whether `name` can stand for exactly one entry of a directory: not empty, not "." or "..",
+  // no "/" and no zero byte. Names that come from outside become file names only if this holds.
+  static bool isSingleComponent(std::string_view name) {
+    return !name.empty() && name != "." && name != ".." &&
+           name.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
+  }
   // The daemon's path of a machine path under the root, or "" when it is not under it.
   std::string fromDisk(std::string_view machinePath) const {
     if (!machinePath.starts_with(prefix_)) return {};

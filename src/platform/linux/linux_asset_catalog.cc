@@ -2,17 +2,13 @@
 
 #include "platform/cbor_codec.h"
 #include "platform/linux/atomic_file.h"
+#include "platform/linux/device_root.h"
 #include "platform/log.h"
 #include "platform/plist_reader.h"
 
 namespace typhora {
 
 namespace {
-
-bool isTypeName(const std::string& assetType) {
-  return !assetType.empty() && assetType != "." && assetType != ".." &&
-         assetType.find('/') == std::string::npos && assetType.find('\0') == std::string::npos;
-}
 
 bool matches(const Value& attributes, const AssetCatalog::Filters& filters) {
   for (const auto& [key, wanted] : filters) {
@@ -35,7 +31,7 @@ std::string LinuxAssetCatalog::catalogPath(const std::string& assetType) const {
 
 std::vector<Value> LinuxAssetCatalog::queryMetadata(const std::string& assetType,
                                                     const Filters& filters) {
-  if (!isTypeName(assetType)) return {};
+  if (!DeviceRoot::isSingleComponent(assetType)) return {};
   std::string error;
   std::optional<Value> catalog = PlistReader::readFile(catalogPath(assetType), {}, &error);
   const ValueArray* assets = catalog ? catalog->asArray() : nullptr;
@@ -62,7 +58,7 @@ void LinuxAssetCatalog::downloadCatalog(const std::string& assetType, bool /*dis
 }
 
 long LinuxAssetCatalog::download(const std::string& assetType) {
-  if (!isTypeName(assetType)) return kBadAssetType;
+  if (!DeviceRoot::isSingleComponent(assetType)) return kBadAssetType;
   std::optional<Value> sources =
       PlistReader::readFile(root_.onDisk("/etc/typhora/asset-sources.plist"), {}, nullptr);
   const std::string* source = sources ? sources->get(assetType).asString() : nullptr;

@@ -6,6 +6,7 @@
 
 #include "platform/cbor_codec.h"
 #include "platform/linux/atomic_file.h"
+#include "platform/linux/device_root.h"
 #include "platform/linux/font_face_names.h"
 #include "platform/log.h"
 #include "platform/plist_reader.h"
@@ -26,11 +27,6 @@ constexpr const char* kFontFiles = "/var/mobile/Library/UserFonts/FontFiles/";
 constexpr const char* kFontAssets = "/var/mobile/Library/UserFonts/FontAssets/";
 constexpr const char* kAssetStore = "/private/var/Cargell/AssetsV2/com_zorvane_Cargell_Font6/";
 constexpr const char* kFileUrlScheme = "file://";
-
-bool isDirectoryName(const std::string& name) {
-  return !name.empty() && name != "." && name != ".." && name.find('/') == std::string::npos &&
-         name.find('\0') == std::string::npos;
-}
 
 std::vector<DictionaryEntry> entriesOf(const Value& info) {
   const Dictionary* dictionary = info.asDictionary();
@@ -70,12 +66,12 @@ void LinuxUserFontManager::reset() {
 
 std::optional<std::string> LinuxUserFontManager::directoryNameFromIdentifier(
     const std::string& identifier) {
-  return isDirectoryName(identifier) ? std::optional(identifier) : std::nullopt;
+  return DeviceRoot::isSingleComponent(identifier) ? std::optional(identifier) : std::nullopt;
 }
 
 std::optional<std::string> LinuxUserFontManager::identifierFromDirectoryName(
     const std::string& name) {
-  return isDirectoryName(name) ? std::optional(name) : std::nullopt;
+  return DeviceRoot::isSingleComponent(name) ? std::optional(name) : std::nullopt;
 }
 
 Value LinuxUserFontManager::readInfo(const char* path) const {
@@ -232,8 +228,8 @@ bool LinuxUserFontManager::mirrorAssetsLocked() {
     return false;
   }
   // Only a complete mirror is recorded: a failed file is retried by the next synchronisation.
-  if (ok && !AtomicFile::write(root_.onDisk(kMirrorIndex), CborCodec::encode(wantedIndex), 0644,
-                               &error))
+  if (ok &&
+      !AtomicFile::write(root_.onDisk(kMirrorIndex), CborCodec::encode(wantedIndex), 0644, &error))
     TYLog_Error(kTYLogTyphoraDaemon, "font registry: cannot write %@: %@", kMirrorIndex, error);
   return ok;
 }

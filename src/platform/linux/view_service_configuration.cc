@@ -1,5 +1,6 @@
 #include "platform/linux/view_service_configuration.h"
 
+#include "platform/linux/device_root.h"
 #include "platform/plist_reader.h"
 
 namespace typhora {
@@ -10,17 +11,11 @@ constexpr const char* kProgramKey = "Program";
 constexpr const char* kArgumentsKey = "Arguments";
 constexpr std::size_t kLargestConfiguration = 1u << 20;
 
-// A service name becomes one file name: nothing that could leave the directory.
-bool isFileName(const std::string& name) {
-  return !name.empty() && name != "." && name != ".." && name.find('/') == std::string::npos &&
-         name.find('\0') == std::string::npos;
-}
-
 }  // namespace
 
 std::optional<ViewServiceConfiguration> ViewServiceConfiguration::load(
     const std::string& deviceRoot, const std::string& serviceName, std::string* error) {
-  if (!isFileName(serviceName)) {
+  if (!DeviceRoot::isSingleComponent(serviceName)) {
     *error = "'" + serviceName + "' is not a view service name";
     return std::nullopt;
   }
