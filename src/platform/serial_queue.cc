@@ -2,6 +2,13 @@
 // ready list or a worker (or an inline sync caller) drains it; only then may its jobs run, so
 // they run one at a time. A worker that blocks inside a job keeps its thread: the pool starts
 // another for other queues, up to its cap, and idle workers leave after a while.
+//
+// A queue that a sync() caller waits on never depends on a free worker: it goes to the front of
+// the line and, when no worker is idle, gets a new one even past the cap. Without that, callers
+// blocked in sync() could hold every worker while the queue they wait for sits in the ready list
+// for good. The extra threads are bounded by the number of queues being waited on, and leave
+// when idle like the others. (Waiters do not run the queue's jobs themselves: a job must not see
+// the waiter's thread state, such as its current connection.)
 #include "platform/serial_queue.h"
 
 #include <algorithm>
@@ -26,6 +33,7 @@ struct SerialQueue::State {
   std::condition_variable jobsReady;  // manual queues: wakes run()
   std::deque<Job> jobs;
   bool scheduled = false;
+  std::size_t waiters = 0;  // sync() callers blocked until a job of theirs has run
 };
 
 namespace {
@@ -54,17 +62,27 @@ class WorkerPool {
     return *pool;
   }
 
-  void submit(StatePtr state) {
+  // `waitedOn`: a sync() caller blocks on the queue, so it goes first and gets a worker whatever
+  // the cap.
+  void submit(StatePtr state, bool waitedOn) {
     std::lock_guard lock(mutex_);
-    ready_.push_back(std::move(state));
-    // A woken worker stays counted as idle until it runs, so compare against all ready queues:
-    // each needs an idle worker of its own, or a new one.
-    if (idle_ >= ready_.size()) {
-      wake_.notify_one();
-    } else if (threads_ < limit_) {
-      ++threads_;
-      std::thread([this] { workerLoop(); }).detach();
+    if (waitedOn) {
+      ready_.push_front(std::move(state));
+    } else {
+      ready_.push_back(std::move(state));
     }
+    wakeOrStartLocked(waitedOn ? SIZE_MAX : limit_);
+  }
+
+  // A sync() caller now blocks on `state`: if it waits in the ready list, it moves to the front
+  // and gets a worker whatever the cap. (A queue being drained is resubmitted the same way.)
+  void expedite(const StatePtr& state) {
+    std::lock_guard lock(mutex_);
+    auto it = std::find(ready_.begin(), ready_.end(), state);
+    if (it == ready_.end()) return;  // a worker took it meanwhile
+    ready_.erase(it);
+    ready_.push_front(state);
+    wakeOrStartLocked(SIZE_MAX);
   }
 
   void setLimit(std::size_t limit) {
@@ -80,6 +98,17 @@ class WorkerPool {
  private:
   static constexpr auto kIdleExit = std::chrono::seconds(5);
   static constexpr int kJobsPerTurn = 32;  // then the queue goes to the back of the line
+
+  void wakeOrStartLocked(std::size_t cap) {
+    // A woken worker stays counted as idle until it runs, so compare against all ready queues:
+    // each needs an idle worker of its own, or a new one.
+    if (idle_ >= ready_.size()) {
+      wake_.notify_one();
+    } else if (threads_ < cap) {
+      ++threads_;
+      std::thread([this] { workerLoop(); }).detach();
+    }
+  }
 
   void workerLoop() {
     std::unique_lock lock(mutex_);
@@ -100,6 +129,7 @@ class WorkerPool {
   }
 
   void drain(const StatePtr& state) {
+    bool waitedOn = false;
     for (int n = 0;; ++n) {
       SerialQueue::Job job;
       {
@@ -108,14 +138,17 @@ class WorkerPool {
           state->scheduled = false;
           return;
         }
-        if (n == kJobsPerTurn) break;
+        if (n == kJobsPerTurn) {
+          waitedOn = state->waiters > 0;
+          break;
+        }
         job = std::move(state->jobs.front());
         state->jobs.pop_front();
       }
       RunningScope scope(state.get());
       job();
     }
-    submit(state);  // still scheduled: give other queues a turn first
+    submit(state, waitedOn);  // still scheduled: give other queues a turn first
   }
 
   std::mutex mutex_;
@@ -126,11 +159,15 @@ class WorkerPool {
   std::size_t limit_ = 64;
 };
 
-void enqueue(const StatePtr& state, SerialQueue::Job job) {
+// Queues `job`; `waiter` counts the caller among the queue's sync() waiters first.
+void enqueue(const StatePtr& state, SerialQueue::Job job, bool waiter = false) {
   bool submit = false;
+  bool waitedOn = false;
   {
     std::lock_guard lock(state->mutex);
     state->jobs.push_back(std::move(job));
+    if (waiter) ++state->waiters;
+    waitedOn = state->waiters > 0;
     if (state->manual) {
       state->jobsReady.notify_all();
     } else if (!state->scheduled) {
@@ -138,7 +175,11 @@ void enqueue(const StatePtr& state, SerialQueue::Job job) {
       submit = true;
     }
   }
-  if (submit) WorkerPool::shared().submit(state);
+  if (submit) {
+    WorkerPool::shared().submit(state, waitedOn);
+  } else if (waiter && !state->manual) {
+    WorkerPool::shared().expedite(state);
+  }
 }
 
 [[noreturn]] void abortOnQueue(const std::string& message) {
@@ -208,21 +249,28 @@ void SerialQueue::sync(const Job& job) {
         job();
       }
       bool resubmit = false;
+      bool waitedOn = false;
       {
         std::lock_guard lock(state_->mutex);
         resubmit = !state_->jobs.empty();
         state_->scheduled = resubmit;
+        waitedOn = state_->waiters > 0;
       }
-      if (resubmit) WorkerPool::shared().submit(state_);
+      if (resubmit) WorkerPool::shared().submit(state_, waitedOn);
       return;
     }
   }
   Semaphore done;
-  enqueue(state_, [&job, &done] {
-    job();
-    done.signal();
-  });
+  enqueue(
+      state_,
+      [&job, &done] {
+        job();
+        done.signal();
+      },
+      true);
   done.wait();
+  std::lock_guard lock(state_->mutex);
+  --state_->waiters;
 }
 
 void SerialQueue::asyncAfter(Duration delay, Job job) {

@@ -57,6 +57,37 @@ TEST(SerialQueue, BlockedJobsDoNotStarveOtherQueues) {
   EXPECT_EQ(started.load(), kQueues);
 }
 
+TEST(SerialQueue, AQueueThatCallersWaitOnProgressesWhateverThePoolSize) {
+  // Two workers, and a thousand callers, each on its own queue, that sync onto one shared queue.
+  // The shared queue is busy first and has more jobs than one worker's turn, so it goes back in
+  // line behind the callers: every worker ends up blocked in sync() while it waits for a worker.
+  SerialQueue::setPoolLimit(2);
+  constexpr int kCallers = 1000;
+  struct Scene {  // shared with the jobs, which may outlive a failed test
+    std::shared_ptr<SerialQueue> shared = SerialQueue::create("test.shared");
+    std::vector<std::shared_ptr<SerialQueue>> callers;
+    Semaphore open;
+    Semaphore allAnswered;
+    std::atomic<int> quick{0};
+    std::atomic<int> answered{0};
+  };
+  auto scene = std::make_shared<Scene>();
+  scene->shared->async([scene] { scene->open.wait(); });
+  for (int i = 0; i < 100; ++i) scene->shared->async([scene] { ++scene->quick; });
+  for (int i = 0; i < kCallers; ++i) {
+    scene->callers.push_back(SerialQueue::create("test.caller"));
+    scene->callers.back()->async([scene] {
+      scene->shared->sync([] {});
+      if (++scene->answered == kCallers) scene->allAnswered.signal();
+    });
+  }
+  scene->open.signal();
+  const bool done = scene->allAnswered.waitFor(60s);
+  SerialQueue::setPoolLimit(64);
+  ASSERT_TRUE(done) << scene->answered.load() << " of " << kCallers << " callers answered";
+  EXPECT_EQ(scene->quick.load(), 100);
+}
+
 TEST(SerialQueue, SyncRunsInlineOrWaitsAndKnowsItsQueue) {
   auto a = SerialQueue::create("test.a");
   auto b = SerialQueue::create("test.b");
