@@ -1,6 +1,8 @@
 // typhorad: the font access daemon. Builds the Linux platform, starts the daemon in its fixed
 // order and hands the main thread to the main queue for good.
+#include <sys/resource.h>
 #include <unistd.h>
+
 #include <algorithm>
 #include <csignal>
 #include <cstdio>
@@ -13,6 +15,7 @@
 #include "platform/linux/device_root.h"
 #include "platform/linux/heap_reserve.h"
 #include "platform/linux/linux_platform.h"
+#include "platform/linux/lumo_connection.h"
 #include "platform/log.h"
 
 namespace {
@@ -96,12 +99,24 @@ std::size_t startUpHeapBytes(const std::string& root) {
   return ec ? 0 : static_cast<std::size_t>(std::min(4 * size, kMaxBytes));
 }
 
+// Every connection holds descriptors: the soft limit goes up to the hard one, so the
+// per-user connection cap, not the descriptor table, is what a crowd of clients meets first.
+void raiseDescriptorLimit() {
+  rlimit limit{};
+  if (getrlimit(RLIMIT_NOFILE, &limit) != 0 || limit.rlim_cur >= limit.rlim_max) return;
+  limit.rlim_cur = limit.rlim_max;
+  setrlimit(RLIMIT_NOFILE, &limit);
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
   const Options options = parseOptions(argc, argv);
   typhora::HeapReserve::prefault(startUpHeapBytes(options.root));
   std::signal(SIGPIPE, SIG_IGN);
+  raiseDescriptorLimit();
+  // Clients send small calls; the large answers go out, not in.
+  typhora::LumoConnection::setInboundLimits(typhora::LumoLimits::inboundFromClients());
   typhora::setLogLevel(options.level);
   typhora::setLogSink(options.target == "journal" ? typhora::makeJournalLogSink()
                                                   : typhora::makeStderrLogSink());

@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <sys/epoll.h>
+#include <sys/random.h>
 #include <sys/socket.h>
 #include <sys/un.h>
 
@@ -9,9 +10,10 @@
 #include <condition_variable>
 #include <cstring>
 
+#include "platform/linux/lumo_admission.h"
 #include "platform/linux/lumo_endpoint.h"
 #include "platform/linux/lumo_event_loop.h"
-#include "platform/linux/process_identity.h"
+#include "platform/linux/lumo_proxy.h"
 #include "platform/linux/scm_rights.h"
 #include "platform/log.h"
 
@@ -21,11 +23,11 @@ struct LumoConnection::Pending {
   IpcReply onReply;
   IpcErrorHandler onError;
   bool synchronous = false;
-  // Synchronous calls: the answer lands here and wakes the caller.
+  // Synchronous calls: the raw answer lands here and wakes the caller, who decodes it.
   std::mutex mutex;
   std::condition_variable answered;
   bool done = false;
-  std::optional<std::vector<Value>> reply;
+  std::optional<LumoRawFrame> frame;
   std::string error;
 };
 
@@ -39,56 +41,87 @@ namespace {
 
 constexpr const char* kLumoError = "lumo error: %s - %@";
 constexpr std::size_t kReadChunk = 64 * 1024;
+constexpr int kReadsPerTurn = 4;  // then other connections get the I/O thread
+// Undispatched invocations at which a connection stops being read, and the hard bound on their
+// bytes (reached only while a synchronous call keeps a connection read).
+constexpr std::size_t kPauseInvocations = 64;
+constexpr std::size_t kPauseBytes = 1u << 20;
+constexpr std::size_t kHardUndispatchedBytes = 8u << 20;
+// While inbound memory is over its process-wide bound, a connection holding an unfinished frame
+// larger than this is cut off: honest clients send small frames that complete at once.
+constexpr std::size_t kLargePartialFrame = 64u << 10;
+constexpr std::size_t kHelloMaxBytes = 256;
+constexpr auto kHandshakeLimit = std::chrono::seconds(5);
+
+std::mutex limitsMutex;
+LumoLimits processInboundLimits;
 
 void setNonBlocking(int fd) {
   fcntl(fd, F_SETFL, fcntl(fd, F_GETFL) | O_NONBLOCK);
 }
 
-void finish(const std::shared_ptr<LumoConnection::Pending>& p,
-            std::optional<std::vector<Value>> reply, std::string error) {
+void passCredentials(int fd) {
+  int on = 1;
+  setsockopt(fd, SOL_SOCKET, SO_PASSCRED, &on, sizeof on);
+}
+
+void finish(const std::shared_ptr<LumoConnection::Pending>& p, std::optional<LumoRawFrame> frame,
+            std::string error) {
   std::lock_guard lock(p->mutex);
-  p->reply = std::move(reply);
+  p->frame = std::move(frame);
   p->error = std::move(error);
   p->done = true;
   p->answered.notify_all();
 }
 
-class LumoProxy final : public IpcRemoteProxy {
- public:
-  LumoProxy(std::weak_ptr<LumoConnection> connection, IpcErrorHandler onError, bool synchronous)
-      : connection_(std::move(connection)),
-        onError_(std::move(onError)),
-        synchronous_(synchronous) {}
+std::shared_ptr<const IpcEndpoint> makeEndpoint(UniqueFd fd) {
+  return std::make_shared<const LumoEndpoint>(std::move(fd));
+}
 
-  void call(const std::string& wireName, std::vector<Value> arguments, IpcReply onReply) override {
-    auto connection = connection_.lock();
-    if (!connection) {
-      if (onError_) onError_("the connection is gone");
-      return;
-    }
-    connection->call(wireName, std::move(arguments), std::move(onReply), onError_, synchronous_);
-  }
-
- private:
-  std::weak_ptr<LumoConnection> connection_;
-  IpcErrorHandler onError_;
-  bool synchronous_;
-};
+LumoMessage helloWith(const std::array<std::uint8_t, 16>& nonce) {
+  return LumoMessage{LumoMessage::Kind::Hello,
+                     0,
+                     LumoConnection::kVersion,
+                     {Value::data(std::vector<std::uint8_t>(nonce.begin(), nonce.end()))}};
+}
 
 }  // namespace
 
+void LumoConnection::setInboundLimits(const LumoLimits& limits) {
+  std::lock_guard lock(limitsMutex);
+  processInboundLimits = limits;
+}
+
+LumoLimits LumoConnection::inboundLimits() {
+  std::lock_guard lock(limitsMutex);
+  return processInboundLimits;
+}
+
 LumoConnection::LumoConnection(bool outgoing)
-    : outgoing_(outgoing), queue_(SerialQueue::create("com.zorvane.lumo.connection")) {}
+    : outgoing_(outgoing),
+      limits_(inboundLimits()),
+      queue_(SerialQueue::create("com.zorvane.lumo.connection")),
+      splitter_(limits_) {}
 
 LumoConnection::~LumoConnection() {
   if (fd_.valid()) LumoEventLoop::shared().remove(fd_.get());
+  LumoAdmission::shared().addInbound(-static_cast<std::ptrdiff_t>(inboundAccounted_));
 }
 
-std::shared_ptr<LumoConnection> LumoConnection::adopt(UniqueFd fd) {
+std::shared_ptr<LumoConnection> LumoConnection::adopt(UniqueFd fd, ProcessPin peer) {
   auto connection = std::shared_ptr<LumoConnection>(new LumoConnection(false));
   setNonBlocking(fd.get());
-  connection->peer_ = ProcessIdentity::ofSocketPeer(fd.get());
+  passCredentials(fd.get());
   connection->fd_ = std::move(fd);
+  connection->pin_ = std::move(peer);
+  connection->admitted_ = true;
+  connection->handshake_ = Handshake::AwaitingAck;
+  LumoAdmission::shared().awaitHello(connection->pin_.token().uid, connection);
+  // The peer's identity is read: from now on its frames may count, once they carry the nonce.
+  getrandom(connection->nonce_.data(), connection->nonce_.size(), 0);
+  std::string error;
+  if (!connection->send(helloWith(connection->nonce_), &error)) return connection;
+  connection->armHandshakeLimit();
   return connection;
 }
 
@@ -132,8 +165,12 @@ bool LumoConnection::isValid() const {
 }
 
 AuditToken LumoConnection::auditToken() const {
-  std::lock_guard lock(mutex_);
-  return peer_;
+  std::unique_lock lock(mutex_);
+  if (outgoing_ && resumed_) {
+    handshakeDone_.wait_for(lock, kHandshakeLimit,
+                            [this] { return handshake_ == Handshake::Done || !valid_; });
+  }
+  return pin_.token();
 }
 
 bool LumoConnection::connectNow(std::string* error) {
@@ -146,6 +183,7 @@ bool LumoConnection::connectNow(std::string* error) {
     }
     UniqueFd ours(pair[0]);
     UniqueFd theirs(pair[1]);
+    passCredentials(ours.get());
     char byte = 'c';
     iovec iov{&byte, 1};
     msghdr msg{};
@@ -160,6 +198,7 @@ bool LumoConnection::connectNow(std::string* error) {
     fd_ = std::move(ours);
   } else {
     UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    passCredentials(fd.get());
     sockaddr_un address{};
     address.sun_family = AF_UNIX;
     if (path_.size() >= sizeof address.sun_path) return *error = "socket path too long", false;
@@ -170,8 +209,21 @@ bool LumoConnection::connectNow(std::string* error) {
     fd_ = std::move(fd);
   }
   setNonBlocking(fd_.get());
-  peer_ = ProcessIdentity::ofSocketPeer(fd_.get());
   return true;
+}
+
+void LumoConnection::armHandshakeLimit() {
+  std::weak_ptr<LumoConnection> weak = std::static_pointer_cast<LumoConnection>(shared_from_this());
+  queue_->asyncAfter(kHandshakeLimit, [weak] {
+    auto self = weak.lock();
+    if (!self) return;
+    {
+      std::lock_guard lock(self->mutex_);
+      if (self->handshake_ == Handshake::Done) return;
+    }
+    self->refuseOnce("no hello in time");
+    self->end("no hello in time", false);
+  });
 }
 
 void LumoConnection::resume() {
@@ -187,11 +239,16 @@ void LumoConnection::resume() {
       auto self = std::static_pointer_cast<LumoConnection>(shared_from_this());
       LumoEventLoop::shared().add(fd_.get(), EPOLLIN | EPOLLRDHUP,
                                   [self](std::uint32_t events) { self->onEvents(events); });
-      return;
+      // Frames written before the loop watched the socket.
+      updateInterestLocked();
     }
   }
-  SystemLog(kLumoError, "-[LumoConnection resume]", error);
-  end(error, false);
+  if (!error.empty()) {
+    SystemLog(kLumoError, "-[LumoConnection resume]", error);
+    end(error, false);
+    return;
+  }
+  if (outgoing_) armHandshakeLimit();
 }
 
 void LumoConnection::invalidate() {
@@ -207,20 +264,18 @@ void LumoConnection::onEvents(std::uint32_t events) {
     }
   }
   if (error.empty() && (events & (EPOLLIN | EPOLLHUP | EPOLLERR | EPOLLRDHUP)) != 0) {
-    if (!readAvailable(&error)) {
+    if (!readSome(&error)) {
       end(error, true);
       return;
     }
   }
-  if (!error.empty()) {
-    end(error, true);
-  }
+  if (!error.empty()) end(error, true);
 }
 
-bool LumoConnection::readAvailable(std::string* error) {
+bool LumoConnection::readSome(std::string* error) {
   static thread_local std::vector<std::uint8_t> buffer(kReadChunk);
-  for (;;) {
-    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * 16)];
+  for (int turn = 0; turn < kReadsPerTurn; ++turn) {
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(ucred)) + CMSG_SPACE(sizeof(int) * 16)];
     iovec iov{buffer.data(), buffer.size()};
     msghdr msg{};
     msg.msg_iov = &iov;
@@ -234,47 +289,235 @@ bool LumoConnection::readAvailable(std::string* error) {
       *error = n == 0 ? "the peer closed the connection" : std::strerror(errno);
       return false;
     }
-    for (UniqueFd& fd : takeDescriptors(&msg)) decoder_.addDescriptor(std::move(fd));
+    std::vector<UniqueFd> fds = takeDescriptors(&msg);
     if ((msg.msg_flags & MSG_CTRUNC) != 0) {
-      *error = "too many descriptors in one message";
-      SystemLog(kLumoError, "-[LumoConnection read]", *error);
+      refuseOnce(*error = "too many descriptors in one message");
       return false;
     }
-    decoder_.addBytes({buffer.data(), static_cast<std::size_t>(n)});
+    const std::optional<ucred> writer = takeCredentials(&msg);
+    if (!checkWriter(writer.value_or(ucred{}), error)) return false;
+    for (UniqueFd& fd : fds) splitter_.addDescriptor(std::move(fd));
+    splitter_.addBytes({buffer.data(), static_cast<std::size_t>(n)});
     for (;;) {
-      LumoMessage message;
+      LumoRawFrame frame;
       std::string why;
-      auto status = decoder_.next(&message, &why, [](UniqueFd fd) {
-        return std::make_shared<const LumoEndpoint>(std::move(fd));
-      });
-      if (status == LumoFrameDecoder::Status::NeedMore) break;
-      if (status == LumoFrameDecoder::Status::Malformed) {
-        SystemLog(kLumoError, "-[LumoConnection read]", why);
-        *error = why;
+      auto status = splitter_.next(&frame, &why);
+      if (status == LumoFrameSplitter::Status::NeedMore) break;
+      if (status == LumoFrameSplitter::Status::Malformed) {
+        refuseOnce(*error = why);
         return false;
       }
-      handleMessage(std::move(message));
+      if (!takeFrame(std::move(frame), error)) return false;
     }
+    std::lock_guard lock(mutex_);
+    splitterBytes_ = splitter_.bufferedBytes();
+    if (splitter_.heldDescriptors() + undispatchedDescriptors_ >
+        LumoAdmission::shared().limits().descriptorsPerConnection) {
+      *error = "the peer holds too many descriptors";
+    } else if (undispatchedBytes_ > kHardUndispatchedBytes) {
+      *error = "the peer sent more than the connection buffers";
+    } else if (splitter_.bufferedBytes() > kLargePartialFrame &&
+               LumoAdmission::shared().inboundOverLimit()) {
+      *error = "inbound memory over its bound; a large unfinished frame is cut off";
+    }
+    if (!error->empty()) {
+      LumoAdmission::shared().logOnce("inbound", pin_.token().uid, *error);
+      return false;
+    }
+    updateInboundLocked();
+    if (readPaused_) return true;
   }
+  return true;
 }
 
-void LumoConnection::handleMessage(LumoMessage message) {
-  if (message.kind != LumoMessage::Kind::Invoke) return deliverReply(std::move(message));
+bool LumoConnection::checkWriter(const ucred& writer, std::string* error) {
+  const pid_t pid = writer.pid;
+  const uid_t uid = writer.uid;
+  std::lock_guard lock(mutex_);
+  if (pid <= 0) {
+    *error = "a read without its writer's credentials";
+  } else if (outgoing_ && handshake_ == Handshake::AwaitingHello && !pin_.pinned()) {
+    // The Hello's writer becomes the peer; every later read must come from it.
+    pin_ = ProcessPin::ofWriter(pid, uid, writer.gid);
+    if (!pin_.pinned()) *error = "the peer that wrote the hello cannot be identified";
+  } else if (pid != pin_.token().pid || uid != pin_.token().uid) {
+    *error = "a frame written by process " + std::to_string(pid) + ", not by the peer " +
+             std::to_string(pin_.token().pid);
+  }
+  if (error->empty()) return true;
+  if (!refusalLogged_) {
+    refusalLogged_ = true;
+    SystemLog(kLumoError, "-[LumoConnection read]", *error);
+  }
+  return false;
+}
+
+bool LumoConnection::takeFrame(LumoRawFrame frame, std::string* error) {
+  Handshake handshake;
+  {
+    std::lock_guard lock(mutex_);
+    handshake = handshake_;
+  }
+  if (handshake != Handshake::Done || frame.kind == LumoMessage::Kind::Hello) {
+    if (handshake == Handshake::Done || frame.kind != LumoMessage::Kind::Hello) {
+      refuseOnce(*error = handshake == Handshake::Done ? "a second hello"
+                                                       : "a frame written before the hello");
+      return false;
+    }
+    return takeHello(std::move(frame), error);
+  }
+  if (frame.kind != LumoMessage::Kind::Invoke) {
+    routeReply(std::move(frame));
+    return true;
+  }
+  std::lock_guard lock(mutex_);
+  ++undispatched_;
+  undispatchedBytes_ += frame.payload.size();
+  undispatchedDescriptors_ += frame.descriptors.size();
+  if ((undispatched_ >= kPauseInvocations || undispatchedBytes_ >= kPauseBytes) &&
+      synchronousWaiting_ == 0 && !readPaused_) {
+    readPaused_ = true;
+    updateInterestLocked();
+  }
   auto self = std::static_pointer_cast<LumoConnection>(shared_from_this());
-  queue_->async([self, message = std::move(message)] { self->handleInvoke(message); });
+  // Jobs are copyable; the frame's descriptors are not.
+  auto held = std::make_shared<LumoRawFrame>(std::move(frame));
+  queue_->async([self, held] { self->handleInvoke(std::move(*held)); });
+  return true;
 }
 
-void LumoConnection::handleInvoke(const LumoMessage& message) {
+bool LumoConnection::takeHello(LumoRawFrame frame, std::string* error) {
+  if (frame.payload.size() > kHelloMaxBytes || !frame.descriptors.empty()) {
+    refuseOnce(*error = "a malformed hello");
+    return false;
+  }
+  std::optional<LumoMessage> hello = decodeLumoFrame(std::move(frame), limits_, nullptr, error);
+  const std::vector<std::uint8_t>* nonce =
+      hello && hello->values.size() == 1 ? hello->values[0].asData() : nullptr;
+  if (nonce == nullptr || nonce->size() != nonce_.size()) {
+    refuseOnce(*error = "a malformed hello");
+    return false;
+  }
+  if (hello->text != kVersion) {
+    refuseOnce(*error = "a peer speaking " + hello->text + ", not " + kVersion);
+    return false;
+  }
+  std::lock_guard lock(mutex_);
+  if (outgoing_) {
+    // Answer with the nonce before anything held back goes out.
+    std::copy(nonce->begin(), nonce->end(), nonce_.begin());
+    auto ack = std::make_unique<Outgoing>();
+    std::vector<int> none;
+    encodeLumoFrame(helloWith(nonce_), &ack->bytes, &none, nullptr, error);
+    handshake_ = Handshake::Done;
+    handshakeDone_.notify_all();
+    return enqueueLocked(std::move(ack), true, error);
+  }
+  if (!std::equal(nonce->begin(), nonce->end(), nonce_.begin())) {
+    *error = "a hello that does not carry this connection's nonce";
+    if (!refusalLogged_) {
+      refusalLogged_ = true;
+      SystemLog(kLumoError, "-[LumoConnection read]", *error);
+    }
+    return false;
+  }
+  handshake_ = Handshake::Done;
+  handshakeDone_.notify_all();
+  LumoAdmission::shared().helloDone(pin_.token().uid, this);
+  return true;
+}
+
+void LumoConnection::routeReply(LumoRawFrame frame) {
+  std::shared_ptr<Pending> pending;
+  {
+    std::lock_guard lock(mutex_);
+    auto it = pending_.find(frame.id);
+    if (it == pending_.end()) return;  // an answer nobody waits for
+    pending = std::move(it->second);
+    pending_.erase(it);
+  }
+  if (pending->synchronous) return finish(pending, std::move(frame), "");
+  auto self = std::static_pointer_cast<LumoConnection>(shared_from_this());
+  auto held = std::make_shared<LumoRawFrame>(std::move(frame));
+  queue_->async([self, pending, held] {
+    std::string error;
+    std::optional<LumoMessage> message = self->decode(std::move(*held), &error);
+    CurrentScope scope(self);
+    if (!message || message->kind == LumoMessage::Kind::Error) {
+      if (pending->onError) pending->onError(message ? message->text : error);
+    } else if (pending->onReply) {
+      pending->onReply(std::move(message->values));
+    }
+  });
+}
+
+std::optional<LumoMessage> LumoConnection::decode(LumoRawFrame frame, std::string* error) {
+  std::optional<LumoMessage> message =
+      decodeLumoFrame(std::move(frame), limits_, &makeEndpoint, error);
+  if (!message) SystemLog(kLumoError, "-[LumoConnection decode]", *error);
+  return message;
+}
+
+void LumoConnection::updateInboundLocked() {
+  const std::size_t held = (valid_ ? splitterBytes_ : 0) + undispatchedBytes_;
+  LumoAdmission::shared().addInbound(static_cast<std::ptrdiff_t>(held) -
+                                     static_cast<std::ptrdiff_t>(inboundAccounted_));
+  inboundAccounted_ = held;
+}
+
+void LumoConnection::updateInterestLocked() {
+  if (!resumed_ || !valid_ || !fd_.valid()) return;
+  std::uint32_t events = watchingWrites_ ? std::uint32_t{EPOLLOUT} : 0u;
+  if (!readPaused_) events |= EPOLLIN | EPOLLRDHUP;
+  LumoEventLoop::shared().modify(fd_.get(), events);
+}
+
+void LumoConnection::dispatched(std::size_t bytes, std::size_t descriptors) {
+  std::lock_guard lock(mutex_);
+  --undispatched_;
+  undispatchedBytes_ -= bytes;
+  undispatchedDescriptors_ -= descriptors;
+  if (readPaused_ && undispatched_ <= kPauseInvocations / 2 &&
+      undispatchedBytes_ <= kPauseBytes / 2) {
+    readPaused_ = false;
+    updateInterestLocked();
+  }
+  updateInboundLocked();
+}
+
+void LumoConnection::handleInvoke(LumoRawFrame frame) {
+  struct Done {
+    LumoConnection* self;
+    std::size_t bytes;
+    std::size_t descriptors;
+    ~Done() { self->dispatched(bytes, descriptors); }
+  } done{this, frame.payload.size(), frame.descriptors.size()};
+
   std::shared_ptr<const IpcInterface> interface;
   std::shared_ptr<IpcExportedObject> object;
   {
     std::lock_guard lock(mutex_);
-    // Messages that arrived before the peer closed are still served: a one-way call followed
-    // at once by the sender's exit must not be lost.
-    if (!valid_ && !servingAfterPeerClosed_) return;
+    // Calls of a connection that ended are dropped: nobody is left to answer. One-way messages
+    // that arrived before the peer closed are still served: a one-way call followed at once by
+    // the sender's exit must not be lost.
+    if (!valid_ && !(servingAfterPeerClosed_ && frame.id == 0)) return;
     interface = exportedInterface_;
     object = exportedObject_;
   }
+  // A peer that exec'd speaks no more for the program it was identified with. One that has
+  // ended is still heard: its last one-way messages were written while it ran.
+  if (!outgoing_ && pin_.state() == ProcessPin::State::Changed) {
+    refuseOnce("the peer runs another program than the one it was identified with");
+    end("the peer runs another program", false);
+    return;
+  }
+  std::string error;
+  std::optional<LumoMessage> decoded = decode(std::move(frame), &error);
+  if (!decoded) {
+    end(error, false);
+    return;
+  }
+  const LumoMessage& message = *decoded;
   const IpcOperation* op = interface ? interface->find(message.text) : nullptr;
   if (op == nullptr || object == nullptr)
     return refuse(message, "unknown operation " + message.text);
@@ -288,12 +531,12 @@ void LumoConnection::handleInvoke(const LumoMessage& message) {
     auto once = std::make_shared<std::once_flag>();
     reply = [weak, once, id = message.id](std::vector<Value> values) {
       std::call_once(*once, [&] {
-        if (auto connection = weak.lock()) {
-          std::string error;
-          LumoMessage answer{LumoMessage::Kind::Reply, id, "", std::move(values)};
-          if (!connection->send(answer, &error)) {
-            SystemLog(kLumoError, "-[LumoConnection reply]", error);
-          }
+        auto connection = weak.lock();
+        if (!connection || !connection->isValid()) return;  // nobody is left to read it
+        std::string sendError;
+        LumoMessage answer{LumoMessage::Kind::Reply, id, "", std::move(values)};
+        if (!connection->send(answer, &sendError)) {
+          SystemLog(kLumoError, "-[LumoConnection reply]", sendError);
         }
       });
     };
@@ -313,29 +556,13 @@ void LumoConnection::refuse(const LumoMessage& message, const std::string& why) 
   send(LumoMessage{LumoMessage::Kind::Error, message.id, why, {}}, &error);
 }
 
-void LumoConnection::deliverReply(LumoMessage message) {
-  std::shared_ptr<Pending> pending;
+void LumoConnection::refuseOnce(const std::string& why) {
   {
     std::lock_guard lock(mutex_);
-    auto it = pending_.find(message.id);
-    if (it == pending_.end()) return;  // an answer nobody waits for
-    pending = std::move(it->second);
-    pending_.erase(it);
+    if (refusalLogged_) return;
+    refusalLogged_ = true;
   }
-  const bool isError = message.kind == LumoMessage::Kind::Error;
-  if (pending->synchronous) {
-    if (isError) return finish(pending, std::nullopt, message.text);
-    return finish(pending, std::move(message.values), "");
-  }
-  auto self = std::static_pointer_cast<LumoConnection>(shared_from_this());
-  queue_->async([self, pending, isError, message = std::move(message)]() mutable {
-    CurrentScope scope(self);
-    if (isError) {
-      if (pending->onError) pending->onError(message.text);
-    } else if (pending->onReply) {
-      pending->onReply(std::move(message.values));
-    }
-  });
+  SystemLog(kLumoError, "-[LumoConnection read]", why);
 }
 
 bool LumoConnection::send(const LumoMessage& message, std::string* error) {
@@ -352,13 +579,7 @@ bool LumoConnection::send(const LumoMessage& message, std::string* error) {
   {
     std::lock_guard lock(mutex_);
     if (!valid_ || !fd_.valid()) return *error = "the connection is not open", false;
-    if (outboundBytes_ + out->bytes.size() > kOutboundLimit) {
-      cutOff = true;
-    } else {
-      outboundBytes_ += out->bytes.size();
-      outbound_.push_back(std::move(out));
-      if (!flushLocked(error)) cutOff = true;
-    }
+    cutOff = !enqueueLocked(std::move(out), false, error);
   }
   if (cutOff) {
     if (error->empty()) *error = "the peer stopped reading; cut off";
@@ -369,8 +590,23 @@ bool LumoConnection::send(const LumoMessage& message, std::string* error) {
   return true;
 }
 
+bool LumoConnection::enqueueLocked(std::unique_ptr<Outgoing> out, bool first, std::string* error) {
+  if (outboundBytes_ + out->bytes.size() > kOutboundLimit) return false;
+  outboundBytes_ += out->bytes.size();
+  if (first && !outbound_.empty() && outbound_.front()->offset == 0) {
+    outbound_.push_front(std::move(out));
+  } else if (first) {
+    outbound_.insert(outbound_.begin() + (outbound_.empty() ? 0 : 1), std::move(out));
+  } else {
+    outbound_.push_back(std::move(out));
+  }
+  return flushLocked(error);
+}
+
 bool LumoConnection::flushLocked(std::string* error) {
-  while (!outbound_.empty()) {
+  // A connecting side says nothing before the peer's Hello has come and been answered.
+  const bool held = outgoing_ && handshake_ != Handshake::Done;
+  while (!outbound_.empty() && !held) {
     Outgoing& front = *outbound_.front();
     iovec iov{front.bytes.data() + front.offset, front.bytes.size() - front.offset};
     msghdr msg{};
@@ -396,12 +632,11 @@ bool LumoConnection::flushLocked(std::string* error) {
       outbound_.pop_front();
     }
   }
-  const bool wantWrites = !outbound_.empty();
-  if (!wantWrites) sent_.notify_all();
+  const bool wantWrites = !outbound_.empty() && !held;
+  if (outbound_.empty()) sent_.notify_all();
   if (wantWrites != watchingWrites_ && resumed_) {
     watchingWrites_ = wantWrites;
-    const std::uint32_t events = EPOLLIN | EPOLLRDHUP | (wantWrites ? std::uint32_t{EPOLLOUT} : 0u);
-    LumoEventLoop::shared().modify(fd_.get(), events);
+    updateInterestLocked();
   }
   return true;
 }
@@ -432,6 +667,7 @@ void LumoConnection::call(const std::string& wireName, std::vector<Value> argume
   pending->onError = onError;
   pending->synchronous = synchronous;
   std::uint64_t id = 0;
+  const bool waits = synchronous && op->replies;
   if (op->replies) {
     std::lock_guard lock(mutex_);
     if (!valid_) {
@@ -439,6 +675,11 @@ void LumoConnection::call(const std::string& wireName, std::vector<Value> argume
     } else {
       id = nextId_++;
       pending_[id] = pending;
+      if (waits && ++synchronousWaiting_ == 1 && readPaused_) {
+        // The answer may sit behind the invocations that paused reading.
+        readPaused_ = false;
+        updateInterestLocked();
+      }
     }
   }
   if (why.empty() &&
@@ -446,19 +687,29 @@ void LumoConnection::call(const std::string& wireName, std::vector<Value> argume
     std::lock_guard lock(mutex_);
     pending_.erase(id);
   }
+  if (waits && id != 0) {
+    if (why.empty()) {
+      std::unique_lock lock(pending->mutex);
+      pending->answered.wait(lock, [&] { return pending->done; });
+    }
+    std::lock_guard lock(mutex_);
+    --synchronousWaiting_;
+  }
   if (!why.empty()) {
     if (onError) onError(why);
     return;
   }
-  if (!synchronous || id == 0) return;
-  std::unique_lock lock(pending->mutex);
-  pending->answered.wait(lock, [&] { return pending->done; });
-  auto reply = std::move(pending->reply);
+  if (!waits) return;
+  std::optional<LumoRawFrame> frame = std::move(pending->frame);
   std::string error = pending->error;
-  lock.unlock();
+  std::optional<LumoMessage> message;
+  if (frame) {
+    message = decode(std::move(*frame), &error);
+    if (message && message->kind == LumoMessage::Kind::Error) error = message->text;
+  }
   CurrentScope scope(shared_from_this());
-  if (reply) {
-    if (pending->onReply) pending->onReply(std::move(*reply));
+  if (message && message->kind != LumoMessage::Kind::Error) {
+    if (pending->onReply) pending->onReply(std::move(message->values));
   } else if (pending->onError) {
     pending->onError(error);
   }
@@ -480,10 +731,17 @@ void LumoConnection::end(const std::string& reason, bool peerWentAway) {
   std::function<void()> invalidation;
   std::function<void()> interruption;
   std::shared_ptr<IpcExportedObject> object;
+  bool wasAdmitted = false;
+  bool helloPending = false;
   {
     std::lock_guard lock(mutex_);
     if (!valid_) return;
+    // Closing our side: what the socket still takes goes out first, so a last one-way message
+    // sent just before invalidate() is not lost.
+    std::string ignored;
+    if (!peerWentAway && fd_.valid()) flushLocked(&ignored);
     valid_ = false;
+    handshakeDone_.notify_all();
     pending.swap(pending_);
     invalidation = std::move(invalidationHandler_);
     interruption = std::move(interruptionHandler_);
@@ -491,19 +749,20 @@ void LumoConnection::end(const std::string& reason, bool peerWentAway) {
     // job lets go of it.
     servingAfterPeerClosed_ = peerWentAway;
     if (!peerWentAway) object = std::move(exportedObject_);
-    // Closing our side: what the socket still takes goes out first, so a last one-way message
-    // sent just before invalidate() is not lost.
-    std::string ignored;
-    if (!peerWentAway && fd_.valid()) flushLocked(&ignored);
     droppedOutbound_ = !outbound_.empty();
     outbound_.clear();
     sent_.notify_all();
     outboundBytes_ = 0;
+    updateInboundLocked();
+    wasAdmitted = std::exchange(admitted_, false);
+    helloPending = !outgoing_ && handshake_ != Handshake::Done;
     if (fd_.valid()) {
       LumoEventLoop::shared().remove(fd_.get());
       shutdown(fd_.get(), SHUT_RDWR);
     }
   }
+  if (helloPending) LumoAdmission::shared().helloDone(pin_.token().uid, this);
+  if (wasAdmitted) LumoAdmission::shared().release(pin_.token().uid);
   const bool interrupted = peerWentAway && outgoing_ && !pending.empty();
   for (auto& [id, p] : pending) {
     if (p->synchronous) finish(p, std::nullopt, "connection invalidated: " + reason);

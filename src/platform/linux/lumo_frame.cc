@@ -16,6 +16,19 @@ std::uint32_t getU32(const std::uint8_t* at) {
   return v;
 }
 
+// Reads one CBOR unsigned integer (major type 0) at `*at`, advancing it.
+std::optional<std::uint64_t> peekUnsigned(std::span<const std::uint8_t> bytes, std::size_t* at) {
+  if (*at >= bytes.size() || (bytes[*at] >> 5) != 0) return std::nullopt;
+  const std::uint8_t info = bytes[(*at)++] & 0x1f;
+  if (info < 24) return info;
+  if (info > 27) return std::nullopt;
+  const std::size_t width = std::size_t{1} << (info - 24);
+  if (bytes.size() - *at < width) return std::nullopt;
+  std::uint64_t value = 0;
+  for (std::size_t i = 0; i < width; ++i) value = (value << 8) | bytes[(*at)++];
+  return value;
+}
+
 }  // namespace
 
 bool encodeLumoFrame(const LumoMessage& message, std::vector<std::uint8_t>* frame,
@@ -45,9 +58,15 @@ bool encodeLumoFrame(const LumoMessage& message, std::vector<std::uint8_t>* fram
   return true;
 }
 
-LumoFrameDecoder::Status LumoFrameDecoder::next(
-    LumoMessage* message, std::string* error,
-    const std::function<std::shared_ptr<const IpcEndpoint>(UniqueFd)>& toEndpoint) {
+void LumoFrameSplitter::addBytes(std::span<const std::uint8_t> bytes) {
+  if (consumed_ > 0 && consumed_ == buffer_.size()) {
+    buffer_.clear();
+    consumed_ = 0;
+  }
+  buffer_.insert(buffer_.end(), bytes.begin(), bytes.end());
+}
+
+LumoFrameSplitter::Status LumoFrameSplitter::next(LumoRawFrame* frame, std::string* error) {
   auto malformed = [error](std::string why) {
     *error = std::move(why);
     return Status::Malformed;
@@ -63,45 +82,74 @@ LumoFrameDecoder::Status LumoFrameDecoder::next(
   if (available < kLumoHeaderSize + length) return Status::NeedMore;
   if (descriptors_.size() < descriptorCount) return malformed("descriptors missing for a frame");
 
-  std::vector<std::shared_ptr<const IpcEndpoint>> endpoints;
+  // [kind, id, ...]: a definite array of four, then two unsigned integers.
+  std::span<const std::uint8_t> payload(header + kLumoHeaderSize, length);
+  std::size_t at = 1;
+  std::optional<std::uint64_t> kind;
+  std::optional<std::uint64_t> id;
+  if (!payload.empty() && payload[0] == 0x84) {
+    kind = peekUnsigned(payload, &at);
+    if (kind) id = peekUnsigned(payload, &at);
+  }
+  if (!kind || *kind > 3 || !id) return malformed("a message that is not [kind, id, text, values]");
+
+  frame->kind = static_cast<LumoMessage::Kind>(*kind);
+  frame->id = *id;
+  frame->payload.assign(payload.begin(), payload.end());
+  frame->descriptors.clear();
   for (std::uint32_t i = 0; i < descriptorCount; ++i) {
-    endpoints.push_back(toEndpoint ? toEndpoint(std::move(descriptors_[i])) : nullptr);
+    frame->descriptors.push_back(std::move(descriptors_[i]));
   }
   descriptors_.erase(descriptors_.begin(), descriptors_.begin() + descriptorCount);
+  consumed_ += kLumoHeaderSize + length;
+  if (consumed_ == buffer_.size()) {
+    buffer_.clear();
+    consumed_ = 0;
+  } else if (consumed_ > (64u << 10) && consumed_ * 2 > buffer_.size()) {
+    buffer_.erase(buffer_.begin(), buffer_.begin() + static_cast<std::ptrdiff_t>(consumed_));
+    consumed_ = 0;
+  }
+  return Status::Frame;
+}
+
+std::optional<LumoMessage> decodeLumoFrame(
+    LumoRawFrame frame, const LumoLimits& limits,
+    const std::function<std::shared_ptr<const IpcEndpoint>(UniqueFd)>& toEndpoint,
+    std::string* error) {
+  std::vector<std::shared_ptr<const IpcEndpoint>> endpoints;
+  for (UniqueFd& fd : frame.descriptors) {
+    endpoints.push_back(toEndpoint ? toEndpoint(std::move(fd)) : nullptr);
+  }
   EndpointHooks hooks;
   hooks.fromIndex = [&endpoints](std::uint64_t index) -> std::shared_ptr<const IpcEndpoint> {
     return index < endpoints.size() ? endpoints[index] : nullptr;
   };
   DecodeLimits decodeLimits;
-  decodeLimits.maxBytes = limits_.maxPayload;
-  decodeLimits.maxDepth = limits_.maxDepth;
-  std::span<const std::uint8_t> payload(header + kLumoHeaderSize, length);
+  decodeLimits.maxBytes = limits.maxPayload;
+  decodeLimits.maxDepth = limits.maxDepth;
+  decodeLimits.maxItems = limits.maxItems;
   std::string why;
-  std::optional<Value> decoded = CborCodec::decode(payload, decodeLimits, &hooks, &why);
-  consumed_ += kLumoHeaderSize + length;
-  if (consumed_ > (1u << 20) && consumed_ * 2 > buffer_.size()) {
-    buffer_.erase(buffer_.begin(), buffer_.begin() + static_cast<std::ptrdiff_t>(consumed_));
-    consumed_ = 0;
-  } else if (consumed_ == buffer_.size()) {
-    buffer_.clear();
-    consumed_ = 0;
+  std::optional<Value> decoded = CborCodec::decode(frame.payload, decodeLimits, &hooks, &why);
+  if (!decoded) {
+    *error = "undecodable message: " + why;
+    return std::nullopt;
   }
-  if (!decoded) return malformed("undecodable message: " + why);
   const ValueArray* parts = decoded->asArray();
-  std::optional<std::int64_t> kind =
-      parts && parts->size() == 4 ? (*parts)[0].asInt() : std::nullopt;
-  std::optional<std::uint64_t> id =
-      parts && parts->size() == 4 ? (*parts)[1].asUInt() : std::nullopt;
-  const std::string* text = parts && parts->size() == 4 ? (*parts)[2].asString() : nullptr;
-  const ValueArray* values = parts && parts->size() == 4 ? (*parts)[3].asArray() : nullptr;
-  if (!kind || *kind < 0 || *kind > 2 || !id || text == nullptr || values == nullptr) {
-    return malformed("a message that is not [kind, id, text, values]");
+  const bool four = parts != nullptr && parts->size() == 4;
+  std::optional<std::int64_t> kind = four ? (*parts)[0].asInt() : std::nullopt;
+  std::optional<std::uint64_t> id = four ? (*parts)[1].asUInt() : std::nullopt;
+  const std::string* text = four ? (*parts)[2].asString() : nullptr;
+  const ValueArray* values = four ? (*parts)[3].asArray() : nullptr;
+  if (!kind || *kind < 0 || *kind > 3 || !id || text == nullptr || values == nullptr) {
+    *error = "a message that is not [kind, id, text, values]";
+    return std::nullopt;
   }
-  message->kind = static_cast<LumoMessage::Kind>(*kind);
-  message->id = *id;
-  message->text = *text;
-  message->values = *values;
-  return Status::Message;
+  LumoMessage message;
+  message.kind = static_cast<LumoMessage::Kind>(*kind);
+  message.id = *id;
+  message.text = *text;
+  message.values = *values;
+  return message;
 }
 
 }  // namespace typhora

@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <cstring>
 
+#include "platform/linux/lumo_admission.h"
 #include "platform/linux/lumo_connection.h"
 #include "platform/linux/lumo_endpoint.h"
 #include "platform/linux/lumo_event_loop.h"
@@ -59,16 +60,30 @@ void LumoListener::invalidate() {
 
 void LumoListener::onReadable() {
   for (;;) {
+    if (!LumoAdmission::shared().mayAccept([weak = weak_from_this()] {
+          if (auto self = weak.lock()) self->resumeListening();
+        })) {
+      // Too many peers owe their hello: the rest wait in the kernel until one answers, or until
+      // the oldest silent one may be cut off.
+      pauseListening();
+      auto self = shared_from_this();
+      queue_->asyncAfter(LumoAdmission::kHelloGrace, [self] { self->resumeListening(); });
+      return;
+    }
     if (!anonymous_) {
       int fd = accept4(fd_.get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK);
       if (fd < 0) {
         if (errno == EINTR || errno == ECONNABORTED) continue;
+        if (errno == EMFILE || errno == ENFILE || errno == ENOBUFS || errno == ENOMEM) {
+          backOff(std::strerror(errno));
+          return;
+        }
         if (errno != EAGAIN && errno != EWOULDBLOCK) {
           SystemLog("lumo error: %s - %@", "-[LumoListener accept]", std::strerror(errno));
         }
         return;
       }
-      offer(UniqueFd(fd));
+      if (!offer(UniqueFd(fd))) return;
       continue;
     }
     // A connection request: one byte carrying one end of the requester's socket pair.
@@ -82,15 +97,63 @@ void LumoListener::onReadable() {
     msg.msg_controllen = sizeof control;
     ssize_t n = recvmsg(fd_.get(), &msg, MSG_CMSG_CLOEXEC | MSG_DONTWAIT);
     if (n < 0 && errno == EINTR) continue;
+    std::vector<UniqueFd> received = n > 0 ? takeDescriptors(&msg) : std::vector<UniqueFd>{};
+    if (n > 0 && (msg.msg_flags & MSG_CTRUNC) != 0 && received.empty()) {
+      // Out of descriptors: the request is lost with its socket; its sender sees the end.
+      backOff("out of descriptors");
+      return;
+    }
     if (n <= 0) return;
-    std::vector<UniqueFd> received = takeDescriptors(&msg);
     // Exactly one socket per request; anything else is refused and closed.
-    if (received.size() == 1) offer(std::move(received[0]));
+    if (received.size() == 1 && !offer(std::move(received[0]))) return;
   }
 }
 
-void LumoListener::offer(UniqueFd fd) {
-  auto connection = LumoConnection::adopt(std::move(fd));
+void LumoListener::backOff(const std::string& why) {
+  // Out of descriptors: the pending connections stay in the kernel's backlog. Stop watching the
+  // socket for a moment instead of spinning on it, then try again.
+  {
+    std::lock_guard lock(mutex_);
+    if (!backingOff_) {
+      SystemLog("lumo error: %s - %@", "-[LumoListener accept]",
+                "cannot accept (" + why + "); backing off");
+    }
+    backingOff_ = true;
+  }
+  pauseListening();
+  auto self = shared_from_this();
+  queue_->asyncAfter(kBackOff, [self] { self->resumeListening(); });
+}
+
+void LumoListener::pauseListening() {
+  std::lock_guard lock(mutex_);
+  if (!valid_ || !fd_.valid() || paused_) return;
+  paused_ = true;
+  LumoEventLoop::shared().remove(fd_.get());
+}
+
+void LumoListener::resumeListening() {
+  std::lock_guard lock(mutex_);
+  if (!valid_ || !fd_.valid() || !paused_) return;
+  paused_ = false;
+  auto self = shared_from_this();
+  LumoEventLoop::shared().add(fd_.get(), EPOLLIN, [self](std::uint32_t) { self->onReadable(); });
+}
+
+bool LumoListener::offer(UniqueFd fd) {
+  int error = 0;
+  ProcessPin peer = ProcessPin::ofSocketPeer(fd.get(), &error);
+  if (error == EMFILE || error == ENFILE) {
+    backOff(std::strerror(error));
+    return false;
+  }
+  {
+    std::lock_guard lock(mutex_);
+    backingOff_ = false;
+  }
+  if (!peer.pinned()) return true;  // gone, or not identifiable: nothing may speak for it
+  if (!LumoAdmission::shared().admit(peer.token().uid)) return true;
+  auto connection = LumoConnection::adopt(std::move(fd), std::move(peer));
   auto self = shared_from_this();
   queue_->async([self, connection] {
     std::shared_ptr<IpcListenerDelegate> delegate;
@@ -102,6 +165,7 @@ void LumoListener::offer(UniqueFd fd) {
       connection->invalidate();
     }
   });
+  return true;
 }
 
 }  // namespace typhora

@@ -2,6 +2,7 @@
 // systemd socket activation) and anonymous listeners reachable only through their endpoint.
 #pragma once
 
+#include <chrono>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -26,8 +27,17 @@ class LumoListener final : public IpcListener, public std::enable_shared_from_th
 
  private:
   LumoListener() = default;
+  static constexpr auto kBackOff = std::chrono::milliseconds(100);
+
   void onReadable();
-  void offer(UniqueFd fd);
+  void backOff(const std::string& why);
+  // The socket unwatched and watched again (idempotent); a paused listener's peers wait in the
+  // kernel.
+  void pauseListening();
+  void resumeListening();
+  // Pins the peer, counts it against its user's connections, and asks the delegate. False when
+  // out of descriptors: the listener backs off.
+  bool offer(UniqueFd fd);
 
   bool anonymous_ = false;
   UniqueFd fd_;
@@ -38,6 +48,8 @@ class LumoListener final : public IpcListener, public std::enable_shared_from_th
   std::weak_ptr<IpcListenerDelegate> delegate_;
   bool resumed_ = false;
   bool valid_ = true;
+  bool backingOff_ = false;
+  bool paused_ = false;
 };
 
 }  // namespace typhora

@@ -43,6 +43,10 @@ bool executableOf(pid_t pid, std::uint64_t* device, std::uint64_t* inode) {
 
 }  // namespace
 
+std::optional<std::uint64_t> ProcessIdentity::startTime(pid_t pid) {
+  return startTimeOf(pid);
+}
+
 std::optional<std::string> ProcessIdentity::readProcessFile(pid_t pid, const char* name) {
   // Plain reads: a process that ends while its file is read makes the read fail (ESRCH), which
   // must be an answer here, never an exception.

@@ -1,6 +1,7 @@
 // Kernel-verified identity of peer processes, pinned to the process instance.
 #pragma once
 
+#include <cstdint>
 #include <optional>
 #include <string>
 
@@ -18,6 +19,8 @@ class ProcessIdentity {
   // False for the zero token, a process that has gone, a reused pid, or a process that has
   // exec'd another program since the token was taken.
   static bool isValid(const AuditToken& token);
+  // The start time of process `pid` (clock ticks since boot), when it runs.
+  static std::optional<std::uint64_t> startTime(pid_t pid);
   // The contents of /proc/<pid>/<name>; nullopt when it cannot be read (the process has gone).
   static std::optional<std::string> readProcessFile(pid_t pid, const char* name);
   // The executable the token's process runs, when the token is still valid.

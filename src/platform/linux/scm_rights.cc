@@ -30,4 +30,15 @@ std::vector<UniqueFd> takeDescriptors(msghdr* message) {
   return received;
 }
 
+std::optional<ucred> takeCredentials(msghdr* message) {
+  for (cmsghdr* c = CMSG_FIRSTHDR(message); c != nullptr; c = CMSG_NXTHDR(message, c)) {
+    if (c->cmsg_level != SOL_SOCKET || c->cmsg_type != SCM_CREDENTIALS) continue;
+    if (c->cmsg_len < CMSG_LEN(sizeof(ucred))) continue;
+    ucred cred{};
+    std::memcpy(&cred, CMSG_DATA(c), sizeof cred);
+    return cred;
+  }
+  return std::nullopt;
+}
+
 }  // namespace typhora
