@@ -22,6 +22,7 @@
 #include "platform/linux/lumo_service.h"
 #include "platform/semaphore.h"
 #include "support/lumo_test_interface.h"
+#include "support/raw_lumo_client.h"
 
 using namespace typhora;
 
@@ -44,23 +45,8 @@ std::vector<Value> callA(LumoService& service, const std::string& op, std::vecto
 }
 
 int rawConnect(const std::string& dir) {
-  int fd = socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::string path = dir + "/test.a";
-  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
-  if (connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) return -1;
-  return fd;
-}
-
-std::vector<std::uint8_t> frameOf(const std::string& op, std::vector<Value> args,
-                                  std::uint64_t id) {
-  std::vector<std::uint8_t> frame;
-  std::vector<int> fds;
-  std::string error;
-  encodeLumoFrame(LumoMessage{LumoMessage::Kind::Invoke, id, op, std::move(args)}, &frame, &fds,
-                  nullptr, &error);
-  return frame;
+  int fd = raw::connectTo(dir + "/test.a");
+  return fd >= 0 && raw::handshake(fd) ? fd : -1;
 }
 
 class UseEndpoint final : public IpcExportedObject {
@@ -156,7 +142,7 @@ int main(int argc, char** argv) {
   }
   if (mode == "flood") {
     int fd = rawConnect(dir);
-    auto frame = frameOf("echo:reply:", {Value(std::string(1 << 20, 'f'))}, 1);
+    auto frame = raw::frameOf("echo:reply:", {Value(std::string(1 << 20, 'f'))}, 1);
     for (int i = 0; i < 200; ++i) {
       if (send(fd, frame.data(), frame.size(), MSG_NOSIGNAL) < 0) break;
     }

@@ -10,6 +10,7 @@
 #include <thread>
 
 #include "integration/child_process.h"
+#include "platform/linux/lumo_admission.h"
 #include "platform/linux/lumo_service.h"
 #include "platform/linux/process_identity.h"
 #include "platform/semaphore.h"
@@ -178,6 +179,8 @@ TEST_F(LumoTest, AThousandSimultaneousConnectionsAreServed) {
   limit.rlim_cur = std::min<rlim_t>(limit.rlim_max, 8192);
   setrlimit(RLIMIT_NOFILE, &limit);
   if (limit.rlim_cur < 4096) GTEST_SKIP() << "not enough descriptors";
+  // One user opening a thousand connections at once: past the caps a service puts on one user.
+  LumoAdmission::shared().setLimits({2000, 2000, 1u << 30, 64});
   LumoService client(dir_);
   std::vector<std::shared_ptr<IpcConnection>> connections;
   std::atomic<int> replies{0};
@@ -199,6 +202,7 @@ TEST_F(LumoTest, AThousandSimultaneousConnectionsAreServed) {
   for (int i = 0; i < 1000; ++i) ASSERT_TRUE(done.waitFor(30s));
   EXPECT_EQ(replies.load(), 1000);
   for (auto& c : connections) c->invalidate();
+  LumoAdmission::shared().setLimits({});
 }
 
 TEST_F(LumoTest, ATokenStopsValidatingOnceItsProcessExecsAnotherProgram) {

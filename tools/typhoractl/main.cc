@@ -9,6 +9,7 @@
 #include "app_state_command.h"
 #include "client_command.h"
 #include "event_command.h"
+#include "load_command.h"
 #include "plist_command.h"
 #include "view_service_command.h"
 
@@ -25,6 +26,7 @@ constexpr const char* kUsage =
     "  event post|watch      post or watch notifications on the daemon's event socket\n"
     "  activity run ID       run one of the daemon's background activities now\n"
     "  view-service          play the font-install view service an alert starts\n"
+    "  load OPERATION ...    many connections calling one operation at once, with latencies\n"
     "\n"
     "  --runtime-dir DIR     where the daemon's socket is (default $TYPHORA_RUNTIME_DIR,\n"
     "                        else /run/typhora)\n"
@@ -71,6 +73,8 @@ int main(int argc, char** argv) {
     return typhora::ctl::runAppStateCommand(root, {args.begin() + 1, args.end()});
   if (args[0] == "event")
     return typhora::ctl::runEventCommand(options, {args.begin() + 1, args.end()});
+  if (args[0] == "load")
+    return typhora::ctl::runLoadCommand(options, {args.begin() + 1, args.end()});
   if (args[0] == "activity")
     return typhora::ctl::runActivityCommand(options, {args.begin() + 1, args.end()});
   return typhora::ctl::runClientCommand(options, args);

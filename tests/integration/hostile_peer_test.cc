@@ -1,0 +1,217 @@
+// The real daemon against hostile local clients: crowds, pipelines, oversized frames, borrowed
+// identities, hoarded descriptors and memory. Each attack runs as its own process; the daemon
+// must refuse it, stay bounded, and keep answering everyone else. Figures go to stdout.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <fstream>
+#include <iostream>
+#include <sstream>
+
+#include "integration/daemon_test_base.h"
+
+namespace typhora::testing {
+namespace {
+
+using ::testing::HasSubstr;
+using Clock = std::chrono::steady_clock;
+
+const std::string kHostile = std::string(TYPHORA_BINARY_DIR) + "/tests/hostile_peer";
+
+// A figure of /proc/PID/status, in kB (VmRSS, VmHWM).
+long statusKb(pid_t pid, const std::string& field) {
+  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+  std::string line;
+  while (std::getline(status, line)) {
+    if (line.rfind(field + ":", 0) == 0) return std::stol(line.substr(field.size() + 1));
+  }
+  return -1;
+}
+
+long descriptorCount(pid_t pid) {
+  long n = 0;
+  for ([[maybe_unused]] auto& entry :
+       fs::directory_iterator("/proc/" + std::to_string(pid) + "/fd")) {
+    ++n;
+  }
+  return n;
+}
+
+class HostilePeerTest : public DaemonTestBase {
+ protected:
+  std::string socket() const { return (runtime_ / kService).string(); }
+
+  std::vector<std::string> hostile(const std::string& mode, int n = 0) const {
+    return {kHostile, mode, socket(), std::to_string(n)};
+  }
+
+  // A fresh client's call: answered, and how long it took (ms).
+  double freshCall() {
+    const auto start = Clock::now();
+    auto r = ctl({"call", "updatingUserFonts:"});
+    EXPECT_EQ(r.status, 0) << r.all;
+    return std::chrono::duration<double, std::milli>(Clock::now() - start).count();
+  }
+
+  // A copy of typhoractl that a manifest signs as an application allowed to enumerate fonts.
+  std::string installEnumeratingApp() {
+    const fs::path program = dir_ / "apps" / "reader";
+    fs::create_directories(program.parent_path());
+    fs::copy_file(kCtl, program);
+    auto digest = runCommand({"/usr/bin/sha256sum", program.string()}, 20s);
+    fs::create_directories(root_ / "etc/typhora/apps");
+    std::ofstream(root_ / "etc/typhora/apps/reader.plist")
+        << R"({"identifier": "com.example.reader", "executable": ")" << program.string()
+        << R"(", "sha256": ")" << digest.out.substr(0, 64)
+        << R"(", "entitlements": {"com.zorvane.developer.user-fonts": ["font-enumeration"]}})";
+    // Other users run it too.
+    for (const fs::path& p : {dir_, dir_ / "apps", runtime_}) chmod(p.c_str(), 0755);
+    return program.string();
+  }
+};
+
+TEST_F(HostilePeerTest, AThousandSimultaneousCheckinsAreAllAnsweredAndAFreshClientMeanwhile) {
+  const std::string app = installEnumeratingApp();
+  startDaemon();
+  // Four processes at once. As root, each runs as its own user with 250 connections (a user may
+  // hold 256): a thousand check-ins in flight together. Otherwise 60 connections of 4 calls each.
+  const bool root = geteuid() == 0;
+  std::vector<std::unique_ptr<ChildProcess>> loads;
+  const auto start = Clock::now();
+  for (int i = 0; i < 4; ++i) {
+    std::vector<std::string> argv;
+    if (root) {
+      const std::string id = std::to_string(61000 + i);
+      argv = {"/usr/bin/setpriv", "--reuid=" + id, "--regid=" + id, "--clear-groups"};
+    }
+    for (const std::string& a :
+         {app, std::string("--runtime-dir"), runtime_.string(), std::string("load"),
+          std::string("--connections"), std::string(root ? "250" : "60"), std::string("--calls"),
+          std::string(root ? "1" : "4"), std::string("checkin:")}) {
+      argv.push_back(a);
+    }
+    loads.push_back(std::make_unique<ChildProcess>(argv));
+  }
+  double worstFresh = 0;
+  for (int i = 0; i < 5; ++i) worstFresh = std::max(worstFresh, freshCall());
+  for (auto& load : loads) {
+    ASSERT_EQ(load->waitFor(120s), 0) << load->output() << daemon_->output();
+    load->finishOutput();
+    EXPECT_THAT(load->standardOutput(), HasSubstr(R"("errors":0)"));
+  }
+  const double all = std::chrono::duration<double, std::milli>(Clock::now() - start).count();
+  std::cout << "[figures] 1000 check-ins answered in " << all << " ms; worst fresh client "
+            << worstFresh << " ms; per process: " << loads[0]->standardOutput();
+  freshCall();
+}
+
+TEST_F(HostilePeerTest, APipeliningClientDoesNotStarveOthersAndItsCallsDieWithIt) {
+  startDaemon();
+  ChildProcess pipeline(hostile("pipeline", 15));
+  std::this_thread::sleep_for(300ms);
+  double worst = 0;
+  for (int i = 0; i < 10; ++i) worst = std::max(worst, freshCall());
+  // Every fresh call was answered while the pipeline still wrote.
+  EXPECT_EQ(pipeline.waitFor(0ms), -1) << "fresh calls waited for the pipeline to end";
+  ASSERT_EQ(pipeline.waitFor(60s), 0) << pipeline.output();
+  std::cout << "[figures] fresh client worst " << worst << " ms while pipelining; "
+            << pipeline.standardOutput();
+  // Calls still queued when the pipeliner went away are dropped, not run and failed one by one.
+  std::this_thread::sleep_for(500ms);
+  EXPECT_LT(daemon_->countLines("the connection is not open"), 5u);
+}
+
+TEST_F(HostilePeerTest, OversizedFramesAreRefusedWithoutDecodingThem) {
+  startDaemon();
+  freshCall();
+  const long before = statusKb(daemon_->pid(), "VmHWM");
+  auto big = runCommand(hostile("big-frame"), 60s);
+  EXPECT_EQ(big.out, "closed\n") << big.all;
+  EXPECT_TRUE(daemon_->waitForLine("frame larger than the size limit", 5s));
+  const long after = statusKb(daemon_->pid(), "VmHWM");
+  EXPECT_LT(after - before, 16 * 1024) << "kB of peak memory for one refused frame";
+  std::cout << "[figures] peak RSS " << before << " kB before a 4 MB frame, " << after
+            << " kB after\n";
+  freshCall();
+}
+
+TEST_F(HostilePeerTest, NoFrameCountsUnlessThePinnedPeerWroteItAfterTheHello) {
+  installEnumeratingApp();
+  startDaemon();
+  // Written before the hello: what the daemon read of the writer says nothing about it.
+  auto early = runCommand(hostile("before-hello"), 30s);
+  EXPECT_EQ(early.out, "refused\n") << early.all;
+  EXPECT_TRUE(daemon_->waitForLine("a frame written before the hello", 5s));
+  // A forked child speaking on its parent's connection.
+  auto forked = runCommand(hostile("fork-writer"), 30s);
+  EXPECT_EQ(forked.out, "refused\n") << forked.all;
+  EXPECT_TRUE(daemon_->waitForLine("not by the peer", 5s)) << daemon_->output();
+  freshCall();
+}
+
+TEST_F(HostilePeerTest, DescriptorsAndMemoryStayBoundedAndComeBackAfterTheAttack) {
+  startDaemon();
+  freshCall();
+  const pid_t pid = daemon_->pid();
+  const long fdsBefore = descriptorCount(pid);
+  const long rssBefore = statusKb(pid, "VmRSS");
+
+  auto fds = runCommand(hostile("hold-fds"), 30s);
+  EXPECT_THAT(fds.out, HasSubstr("closed")) << fds.all;
+
+  // Forty connections each holding an unfinished frame just under the size limit.
+  ChildProcess partial(hostile("partial", 40));
+  ASSERT_TRUE(partial.waitForLine("holding", 30s)) << partial.output();
+  freshCall();
+  const long rssPartial = statusKb(pid, "VmRSS");
+  EXPECT_LT(rssPartial - rssBefore, 80 * 1024);
+
+  // More connections than one user may hold, and connections that never say hello.
+  ChildProcess crowd(hostile("connections", 300));
+  ASSERT_TRUE(crowd.waitForLine("opened", 60s)) << crowd.output();
+  EXPECT_TRUE(daemon_->waitForLine("holds too many connections", 5s));
+  const long fdsPeak = descriptorCount(pid);
+  crowd.kill(SIGKILL);
+  crowd.wait();
+  ChildProcess silent(hostile("silent", 150));
+  ASSERT_TRUE(silent.waitForLine("opened", 60s)) << silent.output();
+  EXPECT_TRUE(daemon_->waitForLine("too many connections without a hello", 5s));
+  freshCall();
+  const long rssPeak = std::max(rssPartial, statusKb(pid, "VmRSS"));
+  partial.kill(SIGKILL);
+  silent.kill(SIGKILL);
+  partial.wait();
+  silent.wait();
+
+  long fdsAfter = 0;
+  for (int i = 0; i < 200 && (fdsAfter = descriptorCount(pid)) > fdsBefore + 2; ++i) {
+    std::this_thread::sleep_for(25ms);
+  }
+  EXPECT_LE(fdsAfter, fdsBefore + 2);
+  freshCall();
+  std::cout << "[figures] descriptors " << fdsBefore << " -> peak " << fdsPeak << " -> " << fdsAfter
+            << "; RSS " << rssBefore << " kB -> peak " << rssPeak << " kB -> "
+            << statusKb(pid, "VmRSS") << " kB\n";
+}
+
+TEST_F(HostilePeerTest, OutOfDescriptorsTheAcceptLoopBacksOffAndRecovers) {
+  std::vector<std::string> argv = {"/usr/bin/prlimit", "--nofile=96:96"};
+  for (const std::string& a : daemonArgs()) argv.push_back(a);
+  daemon_ = std::make_unique<ChildProcess>(argv);
+  waitForSocket();
+  freshCall();
+  ChildProcess crowd(hostile("connections", 120));
+  ASSERT_TRUE(crowd.waitForLine("opened", 60s)) << crowd.output();
+  std::this_thread::sleep_for(1s);
+  EXPECT_TRUE(daemon_->waitForLine("backing off", 5s)) << daemon_->output();
+  EXPECT_LT(daemon_->countLines("Too many open files"), 5u);
+  crowd.kill(SIGKILL);
+  crowd.wait();
+  freshCall();
+}
+
+}  // namespace
+}  // namespace typhora::testing
