@@ -21,6 +21,19 @@ using Clock = std::chrono::steady_clock;
 
 const std::string kHostile = std::string(TYPHORA_BINARY_DIR) + "/tests/hostile_peer";
 
+// Sanitizers' shadow memory makes resident sizes say nothing about the daemon's own.
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr bool kMemoryMeasurable = false;
+#elif defined(__has_feature)
+#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
+constexpr bool kMemoryMeasurable = false;
+#else
+constexpr bool kMemoryMeasurable = true;
+#endif
+#else
+constexpr bool kMemoryMeasurable = true;
+#endif
+
 // A figure of /proc/PID/status, in kB (VmRSS, VmHWM).
 long statusKb(pid_t pid, const std::string& field) {
   std::ifstream status("/proc/" + std::to_string(pid) + "/status");
@@ -132,7 +145,9 @@ TEST_F(HostilePeerTest, OversizedFramesAreRefusedWithoutDecodingThem) {
   EXPECT_EQ(big.out, "closed\n") << big.all;
   EXPECT_TRUE(daemon_->waitForLine("frame larger than the size limit", 5s));
   const long after = statusKb(daemon_->pid(), "VmHWM");
-  EXPECT_LT(after - before, 16 * 1024) << "kB of peak memory for one refused frame";
+  if (kMemoryMeasurable) {
+    EXPECT_LT(after - before, 16 * 1024) << "kB of peak for one refused frame";
+  }
   std::cout << "[figures] peak RSS " << before << " kB before a 4 MB frame, " << after
             << " kB after\n";
   freshCall();
@@ -167,7 +182,9 @@ TEST_F(HostilePeerTest, DescriptorsAndMemoryStayBoundedAndComeBackAfterTheAttack
   ASSERT_TRUE(partial.waitForLine("holding", 30s)) << partial.output();
   freshCall();
   const long rssPartial = statusKb(pid, "VmRSS");
-  EXPECT_LT(rssPartial - rssBefore, 80 * 1024);
+  if (kMemoryMeasurable) {
+    EXPECT_LT(rssPartial - rssBefore, 80 * 1024);
+  }
 
   // More connections than one user may hold, and connections that never say hello.
   ChildProcess crowd(hostile("connections", 300));

@@ -83,6 +83,9 @@ int runLoadCommand(const ClientOptions& options, const std::vector<std::string>&
     auto connection = service.connectToService(kServiceName);
     connection->setRemoteInterface(typhoraDaemonProtocol());
     connection->resume();
+    // Waits for the daemon's hello: connections are opened one handshake at a time, as a client
+    // should, and the calls below all start together.
+    connection->auditToken();
     connections.push_back(connection);
   }
   const std::size_t total = run.connections * run.calls;

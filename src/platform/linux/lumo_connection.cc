@@ -51,7 +51,11 @@ constexpr std::size_t kHardUndispatchedBytes = 8u << 20;
 // larger than this is cut off: honest clients send small frames that complete at once.
 constexpr std::size_t kLargePartialFrame = 64u << 10;
 constexpr std::size_t kHelloMaxBytes = 256;
-constexpr auto kHandshakeLimit = std::chrono::seconds(5);
+// How long a peer may owe its hello. A service holds a slot for each such peer (and evicts
+// silent ones when the slots run out), so its limit is short; a client waiting for a busy
+// service loses nothing but time, so its limit is long.
+constexpr auto kAcceptedHandshakeLimit = std::chrono::seconds(10);
+constexpr auto kOutgoingHandshakeLimit = std::chrono::seconds(30);
 
 std::mutex limitsMutex;
 LumoLimits processInboundLimits;
@@ -167,7 +171,7 @@ bool LumoConnection::isValid() const {
 AuditToken LumoConnection::auditToken() const {
   std::unique_lock lock(mutex_);
   if (outgoing_ && resumed_) {
-    handshakeDone_.wait_for(lock, kHandshakeLimit,
+    handshakeDone_.wait_for(lock, kOutgoingHandshakeLimit,
                             [this] { return handshake_ == Handshake::Done || !valid_; });
   }
   return pin_.token();
@@ -214,7 +218,7 @@ bool LumoConnection::connectNow(std::string* error) {
 
 void LumoConnection::armHandshakeLimit() {
   std::weak_ptr<LumoConnection> weak = std::static_pointer_cast<LumoConnection>(shared_from_this());
-  queue_->asyncAfter(kHandshakeLimit, [weak] {
+  queue_->asyncAfter(outgoing_ ? kOutgoingHandshakeLimit : kAcceptedHandshakeLimit, [weak] {
     auto self = weak.lock();
     if (!self) return;
     {
