@@ -106,7 +106,7 @@ class LinuxRemoteAlertTest : public ::testing::Test {
     std::ofstream(root_ + "/etc/typhora/view-services/" + service + ".plist") << text;
   }
   void present(const std::string& service, const Value& userInfo) {
-    alert_->makeHandle({service, kController}, {listener_->endpoint()})->activate(userInfo);
+    alert_->makeHandle({service, kController}, {listener_->endpoint()})->activate(userInfo, {});
   }
 
   std::string root_;
