@@ -3,6 +3,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <functional>
+
 #include "integration/daemon_test_base.h"
 #include "platform/json_codec.h"
 
@@ -75,6 +77,14 @@ class FontRequestsProcessTest : public DaemonTestBase {
     return plist(root_ / "var/mobile/Library/Preferences/com.zorvane.typhorad.plist");
   }
   Value userFonts() const { return plist(root_ / "var/mobile/Library/UserFonts/UserFonts.plist"); }
+  // The daemon records and enables after it has answered: waits (up to 10 s) until `settled`.
+  static bool eventually(const std::function<bool()>& settled) {
+    for (int i = 0; i < 1000; ++i) {
+      if (settled()) return true;
+      std::this_thread::sleep_for(10ms);
+    }
+    return settled();
+  }
 };
 
 TEST_F(FontRequestsProcessTest, AnEnabledFamilyIsAnsweredAtOnceRecordedAndCounted) {
@@ -84,6 +94,7 @@ TEST_F(FontRequestsProcessTest, AnEnabledFamilyIsAnsweredAtOnceRecordedAndCounte
   EXPECT_THAT(keys(answer.get("fonts")), ElementsAre(kA));
   // A sandboxed caller gets a token for the file with it.
   EXPECT_NE(answer.get("fonts").get(kA).get("data").asData(), nullptr);
+  ASSERT_TRUE(eventually([&] { return !preferences().get("resolved").isNull(); }));
   EXPECT_EQ(preferences().get("resolved"), Value(1));
   EXPECT_TRUE(preferences().get("missed").isNull());
   EXPECT_EQ(preferences().get("issues").get("com.example.reader"),
@@ -103,9 +114,9 @@ TEST_F(FontRequestsProcessTest, TheChosenProviderFilesComeBackEnabledAndWithTheN
   const Value answer = request(reader, {"--family", "A", "--family", "B"});
   EXPECT_THAT(keys(answer.get("fonts")), ElementsAre(kB2, kA)) << daemon_->output();
 
-  const Value onDisk = userFonts();
-  EXPECT_EQ(onDisk.get(kB2).get("disabled"), Value(false));
-  EXPECT_EQ(onDisk.get(kB1).get("disabled"), Value(true));
+  EXPECT_TRUE(eventually([&] { return userFonts().get(kB2).get("disabled") == Value(false); }));
+  EXPECT_EQ(userFonts().get(kB1).get("disabled"), Value(true));
+  ASSERT_TRUE(eventually([&] { return !preferences().get("issues").isNull(); }));
   EXPECT_EQ(preferences().get("missed"), Value(1));
 
   // The application's next check-in gets what it was given, with a token for each file.
@@ -216,6 +227,7 @@ TEST_F(FontPickerProcessTest, TheFamilyReachesTheClientAndAnUnknownNameAnswersFa
 TEST_F(FontPickerProcessTest, DISABLED_TheDeliveryIsRecordedForTheSignedClientOnly) {
   ASSERT_EQ(pick(client_, "A-Regular").status, 0);
   ASSERT_EQ(pick(kCtl, "A-Regular").status, 0);  // a client nobody signed: nothing to name
+  eventually([&] { return !preferences().get("issues").isNull(); });
   EXPECT_EQ(preferences().get("issues"),
             Value::dictionary({{"com.example.client", Value::array({"U/com.example.shop/A.otf"})}}))
       << preferences().description();
