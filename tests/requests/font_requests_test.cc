@@ -75,7 +75,10 @@ class FontRequestsTest : public ::testing::Test {
     auto connection = std::make_shared<FakeIpcConnection>(token);
     const std::size_t n = connections_.size();
     connections_.push_back(connection);
-    replies_.emplace_back();
+    {
+      std::lock_guard lock(mutex_);
+      replies_.emplace_back();
+    }
     IpcConnection::CurrentScope scope(connection);
     daemon_->requestFonts(requests, [this, n](std::vector<Value> reply) {
       std::lock_guard lock(mutex_);
