@@ -107,16 +107,17 @@ class LinuxRemoteAlertTest : public ::testing::Test {
     std::ofstream(root_ + "/etc/typhora/view-services/" + service + ".plist") << text;
   }
   void present(const std::string& service, const Value& userInfo) {
-    alert_->makeHandle({service, kController}, {listener_->endpoint()})->activate(userInfo, [this] {
-      ++ended_;
-      endedSignal_.signal();
-    });
+    alert_->makeHandle({service, kController}, {listener_->endpoint()})
+        ->activate(userInfo, [ends = ends_] {
+          ++ends->count;
+          ends->signal.signal();
+        });
   }
   // Waits until `count` presented view services have ended (or could not be started).
   bool waitForEnds(int count) {
-    for (int i = ended_.load(); i < count; ++i)
-      if (!endedSignal_.waitFor(kPatience)) return false;
-    return ended_.load() >= count;
+    for (int i = ends_->count.load(); i < count; ++i)
+      if (!ends_->signal.waitFor(kPatience)) return false;
+    return ends_->count.load() >= count;
   }
 
   std::string root_;
@@ -124,8 +125,12 @@ class LinuxRemoteAlertTest : public ::testing::Test {
   std::shared_ptr<ViewServiceServer> server_ = std::make_shared<ViewServiceServer>();
   std::shared_ptr<IpcListener> listener_;
   std::unique_ptr<LinuxRemoteAlert> alert_;
-  std::atomic<int> ended_{0};
-  Semaphore endedSignal_;
+  // Shared with the handlers, which the I/O thread may still be leaving when a test ends.
+  struct Ends {
+    std::atomic<int> count{0};
+    Semaphore signal;
+  };
+  std::shared_ptr<Ends> ends_ = std::make_shared<Ends>();
 };
 
 TEST_F(LinuxRemoteAlertTest, TheViewServiceGetsTheUserInfoAndAnswersThroughTheEndpoint) {
@@ -173,7 +178,7 @@ TEST_F(LinuxRemoteAlertTest, ProgramsThatIgnoreTheirInputOrFailAreReapedQuietly)
   // Each end is reported once, after the process was reaped.
   EXPECT_TRUE(waitForEnds(6));
   std::this_thread::sleep_for(100ms);
-  EXPECT_EQ(ended_.load(), 6);
+  EXPECT_EQ(ends_->count.load(), 6);
 }
 
 TEST_F(LinuxRemoteAlertTest, BadConfigurationsAreLoggedAndStartNothing) {
@@ -190,7 +195,7 @@ TEST_F(LinuxRemoteAlertTest, BadConfigurationsAreLoggedAndStartNothing) {
   for (const auto& line : log.lines()) EXPECT_EQ(line.level, LogLevel::Error) << line.message;
   EXPECT_THAT(children(), ::testing::IsEmpty());
   // Nothing was started, so nothing will answer: each says so at once.
-  EXPECT_EQ(ended_.load(), 6);
+  EXPECT_EQ(ends_->count.load(), 6);
 }
 
 }  // namespace
