@@ -2,6 +2,7 @@
 // "com.zorvane.developer.user-fonts" of its signing record, with the block list for enumeration.
 #include <algorithm>
 
+#include "access/user_fonts_entitlement.h"
 #include "daemon/typhora_daemon.h"
 #include "platform/log.h"
 
@@ -9,19 +10,8 @@ namespace typhora {
 
 namespace {
 
-constexpr const char* kUserFontsEntitlement = "com.zorvane.developer.user-fonts";
-constexpr const char* kFontEnumeration = "font-enumeration";
-constexpr const char* kAppUsage = "app-usage";
-constexpr const char* kSystemInstallation = "system-installation";
 constexpr const char* kFontPickerIdentifier = "com.zorvane.Panelor.FontPicker";
 constexpr const char* kBlacklisted = "BLACKLISTED - %@";
-
-bool containsString(const ValueArray& items, const std::string& wanted) {
-  return std::any_of(items.begin(), items.end(), [&wanted](const Value& item) {
-    const std::string* text = item.asString();
-    return text != nullptr && *text == wanted;
-  });
-}
 
 }  // namespace
 
@@ -32,15 +22,12 @@ void TyphoraDaemon::capabilitiesFor(const AuditToken& token, bool* allowEnumerat
   *andIdentifier = std::nullopt;
   std::optional<CodeSigningRecord> record = platform_.codeSigning.codeSigningRecord(token);
   if (!record) return;
-  const ValueArray* capabilities = record->entitlementValue(kUserFontsEntitlement).asArray();
-  const bool enumeration =
-      capabilities != nullptr && containsString(*capabilities, kFontEnumeration);
-  *allowUserFonts = capabilities != nullptr && containsString(*capabilities, kAppUsage);
-  *allowInstallation =
-      capabilities != nullptr && containsString(*capabilities, kSystemInstallation);
+  const UserFontsEntitlement entitlement = UserFontsEntitlement::of(*record);
+  *allowUserFonts = entitlement.appUsage;
+  *allowInstallation = entitlement.installation;
   *andIdentifier = record->signingIdentifier();
   *allowEnumerate =
-      enumeration && andIdentifier->has_value() && isIdentifierAllowed(**andIdentifier);
+      entitlement.enumeration && andIdentifier->has_value() && isIdentifierAllowed(**andIdentifier);
 }
 
 bool TyphoraDaemon::isIdentifierAllowed(const std::string& identifier) {

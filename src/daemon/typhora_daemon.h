@@ -16,6 +16,7 @@
 #include "platform/platform.h"
 #include "platform/serial_queue.h"
 #include "platform/value.h"
+#include "requests/request_fonts_gate.h"
 
 namespace typhora {
 
@@ -116,6 +117,22 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   std::set<std::string> providerIdentifiersFromFamilyName(const std::string& familyName);
   std::set<std::string> providerIdentifiersAndFamilyName(std::optional<std::string>* familyName,
                                                          const std::string& fromPostScriptName);
+
+  // --- Font requests (requests/font_requests.cc, requests/font_picker_request.cc) ---
+
+  // IPC: the caller's fonts of the requested families and PostScript names, after the user's
+  // choice in the missing-fonts dialog when some are unknown or disabled. One request at a time
+  // passes the gate; the reply is called exactly once.
+  void requestFonts(const ValueArray& requests, const IpcReply& reply);
+  // IPC: delivers the fonts of the family of PostScript font `name` to the font-picker client
+  // at `forClient`; replies with the client's answer, or false.
+  void requestFonts(const std::string& name, std::shared_ptr<const IpcEndpoint> forClient,
+                    const IpcReply& reply);
+  // The gate's one second after an answer, before the next request may pass.
+  static constexpr Duration kRequestFontsGateDelay = std::chrono::seconds(1);
+  // The longest a font-picker client may take to answer each call.
+  static constexpr Duration kFontPickerClientTimeout = std::chrono::seconds(10);
+  const RequestFontsGate& requestFontsGate() const { return requestFontsGate_; }
 
   // --- Font requests: the missing-fonts dialog (requests/missing_fonts_dialog.cc) ---
 
@@ -223,6 +240,22 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   void checkAssetUpdate(ScheduledActivityState state);
 
  private:
+  // What a font request knows of its caller from the moment it enters.
+  struct RequestFontsCaller {
+    AuditToken token;
+    std::string identifier;
+    bool enumeration = false;
+  };
+
+  void admitRequestFonts(const ValueArray& requests, const RequestFontsCaller& caller,
+                         const std::weak_ptr<IpcConnection>& connection, const IpcReply& reply);
+  void resolveRequestFonts(const ValueArray& requests, const RequestFontsCaller& caller,
+                           const IpcReply& reply);
+  void completeRequestFonts(const RequestFontsCaller& caller, const Value& firstAnswer,
+                            const ValueArray& answer, const IpcReply& reply);
+  // Returns the gate's permit `after` from now, through the main queue.
+  void releaseRequestFontsGate(Duration after);
+
   SerialQueue& updateQueue();
   // The cache, loaded from disk when absent. Called with userFontsInfoMutex_ held.
   const Value& loadedUserFontsInfoLocked();
@@ -252,6 +285,7 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   std::mutex ledgerMutex_;
 
   LocalNotificationCenter localNotificationCenter_;
+  RequestFontsGate requestFontsGate_;
   // The most recent dialog's handler; replaced on mainHandlerQueue by the next dialog.
   std::shared_ptr<MissingFontsDialogHandler> missingFontsDialogHandler_;
 

@@ -52,6 +52,14 @@ bool TyphoraDaemon::forwardInvocation(const IpcOperation& operation,
     synchronizeFontAssets(stringsOf(arguments.at(0)), reply);
     return true;
   }
+  if (name == op::kRequestFonts) {
+    requestFonts(*arguments.at(0).asArray(), reply);
+    return true;
+  }
+  if (name == op::kRequestFontsForClient) {
+    requestFonts(*arguments.at(0).asString(), *arguments.at(1).asEndpoint(), reply);
+    return true;
+  }
   if (name == op::kResetIssuedFontsFor) {
     resetIssuedFontsFor(*arguments.at(0).asString(), reply);
     return true;

@@ -38,7 +38,8 @@ bool TyphoraHandler::invoke(const IpcOperation& operation, const std::vector<Val
     return true;
   }
   if (name == op::kCheckinForBrisvelProcess) {
-    return false;  // web-content check-in is not served yet: refused as unrecognised
+    checkinForBrisvelProcess(*arguments.at(0).asEndpoint(), reply);
+    return true;
   }
   return server_->forwardInvocation(operation, arguments, reply);
 }

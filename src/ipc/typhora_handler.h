@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/ipc_connection.h"
+#include "platform/ipc_endpoint.h"
 
 namespace typhora {
 
@@ -28,6 +29,15 @@ class TyphoraHandler final : public IpcExportedObject,
   // the fonts and tokens it may have.
   void checkin(const IpcReply& reply);
   void checkinForFontPicker(const IpcReply& reply);
+
+  // Web-content support (ipc/web_content_support.cc), on the application's connection queue:
+  // connects to the web-content process at `endpoint`, hands it the fonts and tokens the
+  // application's capabilities allow, issued for the web-content process, and replies once the
+  // web-content process has acknowledged them.
+  void checkinForBrisvelProcess(std::shared_ptr<const IpcEndpoint> endpoint, const IpcReply& reply);
+  void addWebContentProcessConnection(std::shared_ptr<IpcConnection> connection);
+  // Removes `connection` from webcontentProcessConnections, if there.
+  void removeWebContentProcessConnection(const IpcConnection* connection);
 
   // Font changes, on mainHandlerQueue, for handlers registered by checkin
   // (ipc/font_change_fanout.cc): the client is sent what it may see of the change.

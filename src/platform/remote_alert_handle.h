@@ -2,6 +2,7 @@
 // the presented controller talks back, and the user info handed to it on activation.
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <string>
 
@@ -22,9 +23,14 @@ struct RemoteAlertConfiguration {
 class RemoteAlertHandle {
  public:
   virtual ~RemoteAlertHandle() = default;
-  // Presents the controller with `userInfo` (a dictionary). Presenting reports no outcome; the
-  // view service answers, if at all, over the configuration's endpoint.
-  virtual void activate(const Value& userInfo) = 0;
+  // Runs once, on any thread, when the presented view service could not be started or has
+  // ended: after that, nothing more can come from it over the endpoint that it had not already
+  // sent.
+  using EndedHandler = std::function<void()>;
+
+  // Presents the controller with `userInfo` (a dictionary). The view service answers, if at all,
+  // over the configuration's endpoint; `ended` (may be empty) tells when it no longer can.
+  virtual void activate(const Value& userInfo, EndedHandler ended) = 0;
 };
 
 }  // namespace typhora

@@ -2,6 +2,7 @@
 
 #include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
+#include "platform/log.h"
 
 namespace typhora {
 
@@ -9,6 +10,8 @@ namespace {
 
 constexpr const char* kViewService = "com.zorvane.FontInstallViewService";
 constexpr const char* kController = "FontInstallMissingController";
+constexpr const char* kNoListener =
+    "missing fonts dialog: no listener for the view service's answer; nothing is chosen";
 
 }  // namespace
 
@@ -26,6 +29,12 @@ void MissingFontsDialogHandler::showDialogWithUserInfo(const Value& userInfo) {
   if (!server) return;
   Platform& platform = server->platform();
   std::shared_ptr<IpcListener> listener = platform.ipc.makeAnonymousListener();
+  if (!listener) {
+    // Out of descriptors, for instance: no view service could answer.
+    TYLog_Error(kTYLogTyphoraDaemon, kNoListener);
+    doneWithMissingFonts({});
+    return;
+  }
   listener->setDelegate(weak_from_this());
   auto handle =
       platform.remoteAlert.makeHandle({kViewService, kController}, {listener->endpoint()});
@@ -34,11 +43,37 @@ void MissingFontsDialogHandler::showDialogWithUserInfo(const Value& userInfo) {
     listener_ = listener;
   }
   listener->resume();
-  handle->activate(userInfo);
+  std::weak_ptr<MissingFontsDialogHandler> weak = weak_from_this();
+  handle->activate(userInfo, [weak] {
+    if (auto handler = weak.lock()) handler->viewServiceEnded();
+  });
+}
+
+void MissingFontsDialogHandler::viewServiceEnded() {
+  auto server = daemon_.lock();
+  if (!server) return;
+  // Once connected, the connection's end decides; before, give a connection the view service
+  // made just before it ended the time to be accepted.
+  std::weak_ptr<MissingFontsDialogHandler> weak = weak_from_this();
+  server->platform().clock.schedule(kEndedGrace, Duration::zero(), [weak] {
+    if (auto handler = weak.lock()) handler->answerNothingUnlessConnected();
+  });
+}
+
+void MissingFontsDialogHandler::answerNothingUnlessConnected() {
+  {
+    std::lock_guard lock(mutex_);
+    if (connected_) return;
+  }
+  doneWithMissingFonts({});
 }
 
 bool MissingFontsDialogHandler::shouldAcceptNewConnection(
     IpcListener& /*listener*/, std::shared_ptr<IpcConnection> connection) {
+  {
+    std::lock_guard lock(mutex_);
+    connected_ = true;
+  }
   connection->setExportedInterface(fontInstallViewServiceProtocol());
   connection->setExportedObject(shared_from_this());
   // A view service that goes away without an answer must not leave the request waiting.

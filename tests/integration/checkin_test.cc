@@ -13,20 +13,10 @@ using ::testing::Not;
 
 class CheckinProcessTest : public DaemonTestBase {
  protected:
-  // Installs a copy of typhoractl as application `name`, sandboxed, with `entitlements` (JSON).
+  // A sandboxed copy of typhoractl with the user-fonts entitlement `values` (a JSON array).
   std::string install(const std::string& name, const std::string& identifier,
-                      const std::string& entitlements) {
-    const fs::path program = dir_ / "apps" / name;
-    fs::create_directories(program.parent_path());
-    fs::copy_file(kCtl, program);
-    auto digest = runCommand({"/usr/bin/sha256sum", program.string()}, 20s);
-    fs::create_directories(root_ / "etc/typhora/apps");
-    std::ofstream(root_ / "etc/typhora/apps" / (name + ".plist"))
-        << R"({"identifier": ")" << identifier << R"(", "executable": ")" << program.string()
-        << R"(", "sha256": ")" << digest.out.substr(0, 64) << R"(", "entitlements": {)"
-        << R"("com.zorvane.developer.user-fonts": )" << entitlements
-        << R"(}, "sandbox": {"readOnlyPaths": []}})";
-    return program.string();
+                      const std::string& values) {
+    return installApp(name, identifier, R"({"com.zorvane.developer.user-fonts": )" + values + "}");
   }
   CommandResult checkin(const std::string& program) {
     return runCommand({program, "--runtime-dir", runtime_, "call", "checkin:"}, 20s);

@@ -58,6 +58,22 @@ class DaemonTestBase : public ::testing::Test {
     ASSERT_TRUE(fs::exists(socket)) << (daemon_ ? daemon_->output() : "");
   }
 
+  // Installs a copy of typhoractl as application `name`: a manifest signs it as `identifier`
+  // with `entitlements` (a JSON dictionary), sandboxed with no readable paths unless told.
+  std::string installApp(const std::string& name, const std::string& identifier,
+                         const std::string& entitlements, bool sandboxed = true) {
+    const fs::path program = dir_ / "apps" / name;
+    fs::create_directories(program.parent_path());
+    fs::copy_file(kCtl, program);
+    auto digest = runCommand({"/usr/bin/sha256sum", program.string()}, 20s);
+    fs::create_directories(root_ / "etc/typhora/apps");
+    std::ofstream(root_ / "etc/typhora/apps" / (name + ".plist"))
+        << R"({"identifier": ")" << identifier << R"(", "executable": ")" << program.string()
+        << R"(", "sha256": ")" << digest.out.substr(0, 64) << R"(", "entitlements": )"
+        << entitlements << (sandboxed ? R"(, "sandbox": {"readOnlyPaths": []}})" : "}");
+    return program.string();
+  }
+
   CommandResult ctl(std::vector<std::string> args) const {
     std::vector<std::string> argv = {kCtl, "--runtime-dir", runtime_};
     argv.insert(argv.end(), args.begin(), args.end());

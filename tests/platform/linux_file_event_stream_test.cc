@@ -130,22 +130,22 @@ TEST_F(LinuxFileEventStreamTest, NewNestedDirectoriesAreWatchedAndReportedWithTh
 }
 
 TEST_F(LinuxFileEventStreamTest, TreesThatAppearLaterAreTakenUpAndTheirSurroundingsIgnored) {
-  const std::string assets = "/private/var/MobileAsset/AssetsV2/Fonts";
+  const std::string assets = "/private/var/Cargell/AssetsV2/com_zorvane_Cargell_Font6";
   fs::create_directories(onDisk("/private/var"));
   ASSERT_TRUE(makeStream({assets, kFonts}).start());
 
   fs::create_directories(onDisk(assets + "/x/y"));  // several levels at once
   touch(onDisk(assets + "/x/y/font.ttf"));
-  touch(onDisk("/private/var/MobileAsset/unrelated"));
+  touch(onDisk("/private/var/Cargell/unrelated"));
   ASSERT_TRUE(batches_.waitFor(assets + "/x/y/font.ttf"));
   EXPECT_TRUE(batches_.seen(assets));
 
   // Gone, then back again.
-  fs::remove_all(onDisk("/private/var/MobileAsset"));
+  fs::remove_all(onDisk("/private/var/Cargell"));
   fs::create_directories(onDisk(assets));
   touch(onDisk(assets + "/again.ttf"));
   ASSERT_TRUE(batches_.waitFor(assets + "/again.ttf"));
-  EXPECT_THAT(batches_.paths(), Not(Contains("/private/var/MobileAsset/unrelated")));
+  EXPECT_THAT(batches_.paths(), Not(Contains("/private/var/Cargell/unrelated")));
 }
 
 TEST_F(LinuxFileEventStreamTest, ABatchWaitsForTheLatencyOnTheStreamsClock) {

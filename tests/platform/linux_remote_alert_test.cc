@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <filesystem>
 #include <fstream>
 #include <mutex>
@@ -106,7 +107,17 @@ class LinuxRemoteAlertTest : public ::testing::Test {
     std::ofstream(root_ + "/etc/typhora/view-services/" + service + ".plist") << text;
   }
   void present(const std::string& service, const Value& userInfo) {
-    alert_->makeHandle({service, kController}, {listener_->endpoint()})->activate(userInfo);
+    alert_->makeHandle({service, kController}, {listener_->endpoint()})
+        ->activate(userInfo, [ends = ends_] {
+          ++ends->count;
+          ends->signal.signal();
+        });
+  }
+  // Waits until `count` presented view services have ended (or could not be started).
+  bool waitForEnds(int count) {
+    for (int i = ends_->count.load(); i < count; ++i)
+      if (!ends_->signal.waitFor(kPatience)) return false;
+    return ends_->count.load() >= count;
   }
 
   std::string root_;
@@ -114,6 +125,12 @@ class LinuxRemoteAlertTest : public ::testing::Test {
   std::shared_ptr<ViewServiceServer> server_ = std::make_shared<ViewServiceServer>();
   std::shared_ptr<IpcListener> listener_;
   std::unique_ptr<LinuxRemoteAlert> alert_;
+  // Shared with the handlers, which the I/O thread may still be leaving when a test ends.
+  struct Ends {
+    std::atomic<int> count{0};
+    Semaphore signal;
+  };
+  std::shared_ptr<Ends> ends_ = std::make_shared<Ends>();
 };
 
 TEST_F(LinuxRemoteAlertTest, TheViewServiceGetsTheUserInfoAndAnswersThroughTheEndpoint) {
@@ -136,6 +153,7 @@ TEST_F(LinuxRemoteAlertTest, TheViewServiceGetsTheUserInfoAndAnswersThroughTheEn
   ASSERT_TRUE(answer.has_value());
   EXPECT_EQ(*answer, Value::array({"Foo-Bold", "Bar"}));
   EXPECT_THAT(childrenLeft(), ::testing::IsEmpty());
+  EXPECT_TRUE(waitForEnds(1));
   std::ifstream file(printed);
   std::string line;
   std::getline(file, line);
@@ -157,6 +175,10 @@ TEST_F(LinuxRemoteAlertTest, ProgramsThatIgnoreTheirInputOrFailAreReapedQuietly)
     std::this_thread::sleep_for(10ms);
   }
   EXPECT_TRUE(log.contains("ended with status 3"));
+  // Each end is reported once, after the process was reaped.
+  EXPECT_TRUE(waitForEnds(6));
+  std::this_thread::sleep_for(100ms);
+  EXPECT_EQ(ends_->count.load(), 6);
 }
 
 TEST_F(LinuxRemoteAlertTest, BadConfigurationsAreLoggedAndStartNothing) {
@@ -172,6 +194,8 @@ TEST_F(LinuxRemoteAlertTest, BadConfigurationsAreLoggedAndStartNothing) {
   }
   for (const auto& line : log.lines()) EXPECT_EQ(line.level, LogLevel::Error) << line.message;
   EXPECT_THAT(children(), ::testing::IsEmpty());
+  // Nothing was started, so nothing will answer: each says so at once.
+  EXPECT_EQ(ends_->count.load(), 6);
 }
 
 }  // namespace

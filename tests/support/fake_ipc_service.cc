@@ -46,6 +46,7 @@ std::shared_ptr<IpcListener> FakeIpcService::makeNamedListener(const std::string
 }
 
 std::shared_ptr<IpcListener> FakeIpcService::makeAnonymousListener() {
+  if (failAnonymousListeners_) return nullptr;
   auto listener = std::make_shared<FakeIpcListener>();
   listener->makeAnonymous();
   return listener;

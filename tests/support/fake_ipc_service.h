@@ -2,6 +2,7 @@
 // listener's delegate, as the real service does when a process connects.
 #pragma once
 
+#include <atomic>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -58,11 +59,14 @@ class FakeIpcService final : public IpcService {
   std::shared_ptr<FakeIpcListener> listener(const std::string& serviceName) const;
   // Waits until a named listener for `serviceName` has been resumed.
   std::shared_ptr<FakeIpcListener> waitForListener(const std::string& serviceName);
+  // Makes later anonymous listeners fail as they do when no socket pair can be made.
+  void failAnonymousListeners() { failAnonymousListeners_ = true; }
 
  private:
   mutable std::mutex mutex_;
   std::map<std::string, std::shared_ptr<FakeIpcListener>> listeners_;
   Semaphore listenerMade_;
+  std::atomic<bool> failAnonymousListeners_{false};
 };
 
 }  // namespace typhora::testing

@@ -14,7 +14,14 @@ class FakeRemoteAlert final : public RemoteAlert {
     RemoteAlertDefinition definition;
     RemoteAlertConfiguration configuration;
     Value userInfo;
+    RemoteAlertHandle::EndedHandler ended;
   };
+
+  // Makes every later activation fail as a view service that cannot be started does.
+  void failActivations() {
+    std::lock_guard lock(mutex_);
+    failing_ = true;
+  }
 
   std::vector<Activation> activations() const {
     std::lock_guard lock(mutex_);
@@ -31,9 +38,14 @@ class FakeRemoteAlert final : public RemoteAlert {
    public:
     Handle(FakeRemoteAlert& owner, RemoteAlertDefinition d, RemoteAlertConfiguration c)
         : owner_(owner), definition_(std::move(d)), configuration_(std::move(c)) {}
-    void activate(const Value& userInfo) override {
-      std::lock_guard lock(owner_.mutex_);
-      owner_.activations_.push_back({definition_, configuration_, userInfo});
+    void activate(const Value& userInfo, EndedHandler ended) override {
+      bool failing = false;
+      {
+        std::lock_guard lock(owner_.mutex_);
+        owner_.activations_.push_back({definition_, configuration_, userInfo, ended});
+        failing = owner_.failing_;
+      }
+      if (failing && ended) ended();
     }
 
    private:
@@ -44,6 +56,7 @@ class FakeRemoteAlert final : public RemoteAlert {
 
   mutable std::mutex mutex_;
   std::vector<Activation> activations_;
+  bool failing_ = false;
 };
 
 }  // namespace typhora::testing

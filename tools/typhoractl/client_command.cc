@@ -1,14 +1,11 @@
 #include "client_command.h"
 
-#include <chrono>
 #include <iostream>
 #include <memory>
 
-#include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
 #include "platform/json_codec.h"
-#include "platform/linux/lumo_connection.h"
-#include "platform/linux/lumo_service.h"
+#include "service_session.h"
 
 namespace typhora::ctl {
 namespace {
@@ -24,12 +21,6 @@ constexpr const char* kUsage =
     "                     JSON array. --unchecked sends it even when the service does not\n"
     "                     describe it, with whatever arguments are given.\n";
 
-struct CallResult {
-  bool ok = false;
-  std::vector<Value> reply;
-  std::string error;
-};
-
 // An interface describing just `wireName` with untyped arguments, to send what the user typed.
 std::shared_ptr<const IpcInterface> uncheckedInterface(const std::string& wireName,
                                                        std::size_t argumentCount) {
@@ -40,37 +31,7 @@ std::shared_ptr<const IpcInterface> uncheckedInterface(const std::string& wireNa
 
 CallResult callService(const ClientOptions& options, std::shared_ptr<const IpcInterface> remote,
                        const std::string& wireName, std::vector<Value> arguments) {
-  LumoService service(options.runtimeDir);
-  auto connection = service.connectToService(kServiceName);
-  connection->setRemoteInterface(remote);
-  connection->resume();
-
-  CallResult result;
-  const IpcOperation* operation = remote->find(wireName);
-  auto proxy = connection->synchronousRemoteObjectProxy(
-      [&result](const std::string& error) { result.error = error; });
-  proxy->call(wireName, std::move(arguments), [&result](std::vector<Value> reply) {
-    result.ok = true;
-    result.reply = std::move(reply);
-  });
-  // A one-way operation has no reply: it succeeded once it has left.
-  if (operation != nullptr && !operation->replies && result.error.empty()) {
-    auto lumo = std::dynamic_pointer_cast<LumoConnection>(connection);
-    result.ok =
-        lumo == nullptr || lumo->waitUntilSent(std::chrono::seconds(options.timeoutSeconds));
-    if (!result.ok) result.error = "the message could not be sent";
-  }
-  connection->invalidate();
-  return result;
-}
-
-int printCall(const CallResult& result) {
-  if (!result.ok) {
-    std::cerr << "typhoractl: " << (result.error.empty() ? "no reply" : result.error) << "\n";
-    return 1;
-  }
-  std::cout << JsonCodec::encode(Value(ValueArray(result.reply))) << "\n";
-  return 0;
+  return ServiceSession(options, std::move(remote)).call(wireName, std::move(arguments));
 }
 
 int call(const ClientOptions& options, std::vector<std::string> args) {

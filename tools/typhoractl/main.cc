@@ -10,8 +10,12 @@
 #include "client_command.h"
 #include "event_command.h"
 #include "load_command.h"
+#include "font_names_command.h"
+#include "font_picker_command.h"
 #include "plist_command.h"
+#include "request_fonts_command.h"
 #include "view_service_command.h"
+#include "web_content_command.h"
 
 namespace {
 
@@ -27,6 +31,12 @@ constexpr const char* kUsage =
     "  activity run ID       run one of the daemon's background activities now\n"
     "  view-service          play the font-install view service an alert starts\n"
     "  load OPERATION ...    many connections calling one operation at once, with latencies\n"
+    "  request-fonts         ask for fonts by family or PostScript name, as an application\n"
+    "  web-content-app       an application whose web-content processes receive fonts\n"
+    "  web-content           a web-content process (started by web-content-app)\n"
+    "  picker-client         an application that starts the font picker with its endpoint\n"
+    "  pick NAME             the font picker delivering NAME's family to its client\n"
+    "  font-names FILE       a font file's PostScript and family names, as JSON\n"
     "\n"
     "  --runtime-dir DIR     where the daemon's socket is (default $TYPHORA_RUNTIME_DIR,\n"
     "                        else /run/typhora)\n"
@@ -75,6 +85,13 @@ int main(int argc, char** argv) {
     return typhora::ctl::runEventCommand(options, {args.begin() + 1, args.end()});
   if (args[0] == "load")
     return typhora::ctl::runLoadCommand(options, {args.begin() + 1, args.end()});
+  const std::vector<std::string> rest(args.begin() + 1, args.end());
+  if (args[0] == "request-fonts") return typhora::ctl::runRequestFontsCommand(options, rest);
+  if (args[0] == "web-content-app") return typhora::ctl::runWebContentAppCommand(options, rest);
+  if (args[0] == "web-content") return typhora::ctl::runWebContentCommand(rest);
+  if (args[0] == "picker-client") return typhora::ctl::runPickerClientCommand(options, rest);
+  if (args[0] == "pick") return typhora::ctl::runPickCommand(options, rest);
+  if (args[0] == "font-names") return typhora::ctl::runFontNamesCommand(rest);
   if (args[0] == "activity")
     return typhora::ctl::runActivityCommand(options, {args.begin() + 1, args.end()});
   return typhora::ctl::runClientCommand(options, args);

@@ -14,11 +14,14 @@ namespace typhora::ctl {
 namespace {
 
 constexpr const char* kUsage =
-    "usage: typhoractl view-service --controller NAME [--answer JSON-ARRAY] [--print]\n"
+    "usage: typhoractl view-service --controller NAME [--answer JSON-ARRAY]\n"
+    "                               [--choose FAMILY=PROVIDER]... [--print]\n"
     "\n"
     "Plays the font-install view service: reads the user info (JSON) from standard input,\n"
     "connects to the endpoint passed as descriptor 3 and calls doneWithMissingFonts: with the\n"
-    "answer (default []; null for none). --print prints the user info as one JSON line first.\n";
+    "answer (default []; null for none). Each --choose adds the user's choice of PROVIDER for\n"
+    "the disabled family FAMILY to the answer. --print prints the user info as one JSON line\n"
+    "first.\n";
 
 // The descriptor the daemon hands the endpoint over on.
 constexpr int kEndpointFd = 3;
@@ -37,6 +40,17 @@ std::optional<Options> parse(const std::vector<std::string>& args) {
     const bool hasValue = i + 1 < args.size();
     if (args[i] == "--print") {
       options.print = true;
+    } else if (args[i] == "--choose" && hasValue) {
+      const std::string choice = args[++i];
+      const std::size_t equals = choice.find('=');
+      if (equals == std::string::npos || options.answer.asArray() == nullptr) {
+        std::cerr << "typhoractl: --choose takes FAMILY=PROVIDER\n";
+        return std::nullopt;
+      }
+      ValueArray answer = *options.answer.asArray();
+      answer.push_back(Value::dictionary({{"installProvider", choice.substr(equals + 1)},
+                                          {"uniqueID", choice.substr(0, equals)}}));
+      options.answer = Value(std::move(answer));
     } else if (args[i] == "--controller" && hasValue) {
       options.controller = args[++i];
     } else if (args[i] == "--answer" && hasValue) {

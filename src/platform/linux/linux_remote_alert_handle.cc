@@ -20,15 +20,17 @@ LinuxRemoteAlertHandle::LinuxRemoteAlertHandle(std::string deviceRoot,
       definition_(std::move(definition)),
       configuration_(std::move(configuration)) {}
 
-void LinuxRemoteAlertHandle::activate(const Value& userInfo) {
+void LinuxRemoteAlertHandle::activate(const Value& userInfo, EndedHandler ended) {
   std::string error;
-  if (!present(userInfo, &error)) {
+  if (!present(userInfo, ended, &error)) {
     TYLog_Error(kTYLogTyphoraDaemon, "cannot present %s of view service %s: %s",
                 definition_.viewControllerClassName, definition_.serviceName, error);
+    if (ended) ended();
   }
 }
 
-bool LinuxRemoteAlertHandle::present(const Value& userInfo, std::string* error) const {
+bool LinuxRemoteAlertHandle::present(const Value& userInfo, EndedHandler ended,
+                                     std::string* error) const {
   auto configuration = ViewServiceConfiguration::load(deviceRoot_, definition_.serviceName, error);
   if (!configuration) return false;
   const auto* endpoint = dynamic_cast<const LumoEndpoint*>(configuration_.endpoint.get());
@@ -40,7 +42,7 @@ bool LinuxRemoteAlertHandle::present(const Value& userInfo, std::string* error) 
   arguments.push_back(kControllerOption);
   arguments.push_back(definition_.viewControllerClassName);
   return ViewServiceProcess::launch(configuration->program, arguments, endpoint->fd(),
-                                    JsonCodec::encode(userInfo) + "\n", error);
+                                    JsonCodec::encode(userInfo) + "\n", std::move(ended), error);
 }
 
 }  // namespace typhora

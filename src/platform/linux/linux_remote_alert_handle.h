@@ -3,7 +3,8 @@
 //   <Program> <Arguments...> --controller <view controller class name>
 //
 // with the configuration's endpoint as descriptor 3 and the user info as JSON on standard input.
-// Each activation starts the program anew. Failures are logged; presenting reports no outcome.
+// Each activation starts the program anew. A failure to start it is logged and reported as the
+// end of the view service at once; otherwise its exit is, when the process is reaped.
 #pragma once
 
 #include <string>
@@ -16,10 +17,10 @@ class LinuxRemoteAlertHandle final : public RemoteAlertHandle {
  public:
   LinuxRemoteAlertHandle(std::string deviceRoot, RemoteAlertDefinition definition,
                          RemoteAlertConfiguration configuration);
-  void activate(const Value& userInfo) override;
+  void activate(const Value& userInfo, EndedHandler ended) override;
 
  private:
-  bool present(const Value& userInfo, std::string* error) const;
+  bool present(const Value& userInfo, EndedHandler ended, std::string* error) const;
 
   std::string deviceRoot_;
   RemoteAlertDefinition definition_;

@@ -81,7 +81,8 @@ bool failed(std::string* error, const std::string& what, int code) {
 
 bool ViewServiceProcess::launch(const std::string& program,
                                 const std::vector<std::string>& arguments, int endpointFd,
-                                std::string input, std::string* error) {
+                                std::string input, std::function<void()> onExit,
+                                std::string* error) {
   UniqueFd endpoint(fcntl(endpointFd, F_DUPFD_CLOEXEC, kFirstSpareFd));
   if (!endpoint.valid()) return failed(error, "the endpoint's descriptor", errno);
   int fds[2];
@@ -102,16 +103,24 @@ bool ViewServiceProcess::launch(const std::string& program,
   UniqueFd pidfd(static_cast<int>(syscall(SYS_pidfd_open, pid, 0)));
   if (!pidfd.valid()) {
     // Kernels before 5.3 have no pidfd: one waiting thread for this child, then.
-    std::thread([pid] { waitpid(pid, nullptr, 0); }).detach();
+    std::thread([pid, onExit = std::exchange(onExit, {})] {
+      waitpid(pid, nullptr, 0);
+      if (onExit) onExit();
+    }).detach();
   }
-  auto process = std::shared_ptr<ViewServiceProcess>(
-      new ViewServiceProcess(pid, std::move(pidfd), std::move(pipeWrite), std::move(input)));
+  auto process = std::shared_ptr<ViewServiceProcess>(new ViewServiceProcess(
+      pid, std::move(pidfd), std::move(pipeWrite), std::move(input), std::move(onExit)));
   process->watch();
   return true;
 }
 
-ViewServiceProcess::ViewServiceProcess(pid_t pid, UniqueFd pidfd, UniqueFd input, std::string bytes)
-    : pid_(pid), pidfd_(std::move(pidfd)), input_(std::move(input)), bytes_(std::move(bytes)) {}
+ViewServiceProcess::ViewServiceProcess(pid_t pid, UniqueFd pidfd, UniqueFd input, std::string bytes,
+                                       std::function<void()> onExit)
+    : pid_(pid),
+      pidfd_(std::move(pidfd)),
+      input_(std::move(input)),
+      bytes_(std::move(bytes)),
+      onExit_(std::move(onExit)) {}
 
 void ViewServiceProcess::watch() {
   std::lock_guard lock(mutex_);
@@ -149,10 +158,15 @@ void ViewServiceProcess::onExit() {
   if (result == 0 && (info.si_code != CLD_EXITED || info.si_status != 0)) {
     TYLog_Error(kTYLogTyphoraDaemon, "view service %d ended with status %d", pid_, info.si_status);
   }
-  std::lock_guard lock(mutex_);
-  stopWriting();
-  LumoEventLoop::shared().remove(pidfd_.get());
-  pidfd_.reset();
+  std::function<void()> onExit;
+  {
+    std::lock_guard lock(mutex_);
+    stopWriting();
+    LumoEventLoop::shared().remove(pidfd_.get());
+    pidfd_.reset();
+    onExit = std::exchange(onExit_, {});
+  }
+  if (onExit) onExit();
 }
 
 void ViewServiceProcess::stopWriting() {

@@ -9,6 +9,7 @@
 
 #include <sys/types.h>
 
+#include <functional>
 #include <memory>
 #include <mutex>
 #include <string>
@@ -21,12 +22,15 @@ namespace typhora {
 class ViewServiceProcess : public std::enable_shared_from_this<ViewServiceProcess> {
  public:
   // Starts `program` with `arguments` (argv[1...]), `endpointFd` as its descriptor 3 and
-  // `input` on its standard input. False with `error` set when it could not be started.
+  // `input` on its standard input; `onExit` (may be empty) runs once when it has been reaped.
+  // False with `error` set when it could not be started; `onExit` is then not called.
   static bool launch(const std::string& program, const std::vector<std::string>& arguments,
-                     int endpointFd, std::string input, std::string* error);
+                     int endpointFd, std::string input, std::function<void()> onExit,
+                     std::string* error);
 
  private:
-  ViewServiceProcess(pid_t pid, UniqueFd pidfd, UniqueFd input, std::string bytes);
+  ViewServiceProcess(pid_t pid, UniqueFd pidfd, UniqueFd input, std::string bytes,
+                     std::function<void()> onExit);
   void watch();
   void onWritable();
   void onExit();
@@ -38,6 +42,7 @@ class ViewServiceProcess : public std::enable_shared_from_this<ViewServiceProces
   UniqueFd input_;
   std::string bytes_;
   std::size_t written_ = 0;
+  std::function<void()> onExit_;
 };
 
 }  // namespace typhora
