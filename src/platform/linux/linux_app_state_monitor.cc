@@ -56,7 +56,8 @@ bool LinuxAppStateMonitor::setState(pid_t pid, std::optional<int> state, std::st
   // replaced whole.
   std::error_code ec;
   std::filesystem::create_directories(std::filesystem::path(path_).parent_path(), ec);
-  UniqueFd lock(open((path_ + ".lock").c_str(), O_RDONLY | O_CREAT | O_CLOEXEC, 0600));
+  UniqueFd lock(open((path_ + ".lock").c_str(),
+                     O_RDONLY | O_CREAT | O_NONBLOCK | O_NOFOLLOW | O_CLOEXEC, 0600));
   if (lock.valid()) flock(lock.get(), LOCK_EX);
 
   std::vector<DictionaryEntry> entries;

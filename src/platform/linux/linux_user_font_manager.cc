@@ -8,6 +8,7 @@
 #include "platform/linux/atomic_file.h"
 #include "platform/linux/device_root.h"
 #include "platform/linux/font_face_names.h"
+#include "platform/regular_file.h"
 #include "platform/log.h"
 #include "platform/plist_reader.h"
 
@@ -27,6 +28,7 @@ constexpr const char* kFontFiles = "/var/mobile/Library/UserFonts/FontFiles/";
 constexpr const char* kFontAssets = "/var/mobile/Library/UserFonts/FontAssets/";
 constexpr const char* kAssetStore = "/private/var/Cargell/AssetsV2/com_zorvane_Cargell_Font6/";
 constexpr const char* kFileUrlScheme = "file://";
+constexpr std::size_t kMaxMirroredBytes = 256u << 20;
 
 std::vector<DictionaryEntry> entriesOf(const Value& info) {
   const Dictionary* dictionary = info.asDictionary();
@@ -192,13 +194,11 @@ bool LinuxUserFontManager::mirrorAssetsLocked() {
     std::error_code ec;
     fs::create_directories(fs::path(target).parent_path(), ec);
     if (!fs::exists(target, ec)) {
-      const std::string temporary = target + ".partial";
-      ec.clear();
-      fs::copy_file(store, temporary, fs::copy_options::overwrite_existing, ec);
-      if (!ec) fs::rename(temporary, target, ec);
-      if (ec) {
-        TYLog_Error(kTYLogTyphoraDaemon, "font registry: cannot mirror %@: %@", store,
-                    ec.message());
+      std::string error;
+      std::optional<std::vector<std::uint8_t>> bytes =
+          RegularFile::read(store, kMaxMirroredBytes, &error);
+      if (!bytes || !AtomicFile::write(target, *bytes, 0644, &error)) {
+        TYLog_Error(kTYLogTyphoraDaemon, "font registry: cannot mirror %@: %@", store, error);
         ok = false;
         continue;
       }
