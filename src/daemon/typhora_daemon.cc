@@ -44,21 +44,27 @@ TyphoraDaemon& TyphoraDaemon::sharedDaemon() {
   return *daemon;
 }
 
-void TyphoraDaemon::startUp() {
-  setupForLumoService();
+bool TyphoraDaemon::startUp() {
+  if (!setupForLumoService()) return false;
   setupForScheduledFontDeletion();
   setupForDistributedNotifications();
   setupForBlacklistUpdatedNotification();
   setupForMonitoringFontAssets();
   setup();
+  return true;
 }
 
-void TyphoraDaemon::setupForLumoService() {
+bool TyphoraDaemon::setupForLumoService() {
   listener_ = platform_.ipc.makeNamedListener(kServiceName);
+  if (!listener_) {
+    TYLog_Error(kTYLogTyphoraDaemon, "cannot open the service %s", kServiceName);
+    return false;
+  }
   listener_->setDelegate(weak_from_this());
   listener_->resume();
   // From here on connections are admitted on IPC threads while start-up goes on.
   (void)isUserFontInstalled();  // preloads the user-fonts information before the first check-in
+  return true;
 }
 
 // Start-up steps whose subsystems arm nothing yet.

@@ -46,8 +46,9 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   static TyphoraDaemon& sharedDaemon();
 
   // Start-up steps 2 to 7, in their fixed order, on the main thread.
-  void startUp();
-  void setupForLumoService();
+  // False when the service cannot be opened: the daemon then has nothing to serve.
+  bool startUp();
+  bool setupForLumoService();
   void setupForScheduledFontDeletion();
   void setupForDistributedNotifications();
   void setupForBlacklistUpdatedNotification();
