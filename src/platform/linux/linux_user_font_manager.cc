@@ -1,5 +1,7 @@
 #include "platform/linux/linux_user_font_manager.h"
 
+#include <sys/stat.h>
+
 #include <filesystem>
 #include <map>
 #include <set>
@@ -73,7 +75,12 @@ std::optional<std::string> LinuxUserFontManager::directoryNameFromIdentifier(
 
 std::optional<std::string> LinuxUserFontManager::identifierFromDirectoryName(
     const std::string& name) {
-  return DeviceRoot::isSingleComponent(name) ? std::optional(name) : std::nullopt;
+  // Only a provider's own directory: asset, asset-data and other directories name no provider.
+  struct stat info {};
+  if (!DeviceRoot::isSingleComponent(name) ||
+      lstat(root_.onDisk(kFontFiles + name).c_str(), &info) != 0 || !S_ISDIR(info.st_mode))
+    return std::nullopt;
+  return name;
 }
 
 Value LinuxUserFontManager::readInfo(const char* path) const {

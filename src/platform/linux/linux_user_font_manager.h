@@ -31,6 +31,7 @@ class LinuxUserFontManager final : public TYUserFontManager {
   // A provider's directory is named after its identifier; names that cannot be one directory
   // ("", ".", "..", anything with "/") have none.
   std::optional<std::string> directoryNameFromIdentifier(const std::string& identifier) override;
+  // The identifier of a provider whose directory exists under FontFiles/, else none.
   std::optional<std::string> identifierFromDirectoryName(const std::string& name) override;
   Value profileFontsInfo() override;
   Value userFontsInfo() override;
