@@ -225,6 +225,10 @@ class TyphoraDaemon final : public IpcListenerDelegate,
 
  private:
   SerialQueue& updateQueue();
+  // Scheduled deletion's steps, on scheduledFontDeletionQueue: adding to the pending table
+  // (bounded, refusing paths that are not plain), and removing the due files.
+  void addPendingDeletions(const std::vector<std::string>& paths, std::uint32_t delay);
+  void removeDueFontFiles(const std::vector<std::string>& due);
   // The cache, loaded from disk when absent. Called with userFontsInfoMutex_ held.
   const Value& loadedUserFontsInfoLocked();
   std::vector<std::string> issuedFontFilePathsLocked(const Dictionary* issues,

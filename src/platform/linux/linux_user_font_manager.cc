@@ -56,7 +56,9 @@ std::vector<std::string> subdirectories(const std::string& machinePath) {
 }  // namespace
 
 LinuxUserFontManager::LinuxUserFontManager(std::string root)
-    : root_(std::move(root)), queue_(SerialQueue::create("com.zorvane.typhora.fontRegistry")) {}
+    : root_(root),
+      files_(std::move(root)),
+      queue_(SerialQueue::create("com.zorvane.typhora.fontRegistry")) {}
 
 void LinuxUserFontManager::reset() {
   std::error_code ec;
@@ -132,9 +134,10 @@ std::optional<std::string> LinuxUserFontManager::removeProviderLocked(
   std::string error;
   if (entries.size() != before && !writeInfoLocked(Value(Dictionary(std::move(entries))), &error))
     return error;
-  std::error_code ec;
-  fs::remove_all(root_.onDisk(prefix), ec);
-  if (ec) return ec.message();
+  // The directory itself goes, never what a link in its place points to.
+  if (files_.fileExists(kFontFiles + *directory) &&
+      !files_.removeItem(kFontFiles + *directory, &error))
+    return error;
   return std::nullopt;
 }
 
@@ -225,8 +228,8 @@ bool LinuxUserFontManager::mirrorAssetsLocked() {
     bool stillWanted = std::any_of(wanted.begin(), wanted.end(), [&](const auto& entry) {
       return entry.first.starts_with(prefix);
     });
-    std::error_code ec;
-    if (!stillWanted) fs::remove_all(root_.onDisk(prefix), ec);
+    std::string ignored;
+    if (!stillWanted) files_.removeItem(kFontAssets + asset, &ignored);
   }
   Value info(Dictionary(std::vector<DictionaryEntry>(kept.begin(), kept.end())));
   std::string error;

@@ -17,6 +17,7 @@
 #include <string>
 
 #include "platform/linux/device_root.h"
+#include "platform/linux/linux_file_system.h"
 #include "platform/serial_queue.h"
 #include "platform/ty_user_font_manager.h"
 
@@ -50,7 +51,8 @@ class LinuxUserFontManager final : public TYUserFontManager {
   bool mirrorAssetsLocked();
 
   DeviceRoot root_;
-  std::mutex mutex_;  // every change to the registry's files
+  LinuxFileSystem files_;  // removals beneath the root, never through a link
+  std::mutex mutex_;       // every change to the registry's files
   std::shared_ptr<SerialQueue> queue_;
 };
 
