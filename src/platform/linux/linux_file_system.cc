@@ -122,8 +122,7 @@ UniqueFd LinuxFileSystem::openParent(const std::string& path, std::string* name,
 }
 
 bool LinuxFileSystem::fileExists(const std::string& path) const {
-  struct stat info {};
-  return isPlainAbsolutePath(path) && lstat(onDisk(path).c_str(), &info) == 0;
+  return isPlainAbsolutePath(path) && openBeneath(path, O_PATH | O_NOFOLLOW).valid();
 }
 
 std::optional<Value> LinuxFileSystem::readPropertyList(const std::string& path,

@@ -1,7 +1,7 @@
 // The daemon's file operations under a device root: "/var/mobile/x" is "<root>/var/mobile/x".
 //
-// Removal and listing act on paths that clients name. Such a path must be plain (see
-// FileSystem::isPlainAbsolutePath) and is resolved by the kernel beneath the root with no
+// Existence tests, removal and listing act on paths that clients name. Such a path must be plain
+// (see FileSystem::isPlainAbsolutePath) and is resolved by the kernel beneath the root with no
 // symbolic link followed; a tree is removed by descriptor, entry by entry, so a link inside it
 // is removed itself and never leads anywhere.
 #pragma once
