@@ -138,7 +138,10 @@ void TyphoraDaemon::setupUserInstalledFontsFor(const AuditToken& token,
       // Entries of the same path replace the earlier ones: the later entry wins.
       for (const auto& entry : granted.asDictionary()->entries()) fonts.push_back(entry);
     }
-    std::vector<DictionaryEntry> checkin{{"fontsInfo", Value(Dictionary(std::move(fonts)))}};
+    // Room for every key up front: "fontsInfo" and at most two of the others.
+    std::vector<DictionaryEntry> checkin;
+    checkin.reserve(3);
+    checkin.emplace_back("fontsInfo", Value(Dictionary(std::move(fonts))));
     if (hasEnumeration) {
       if (Value extension = sandboxExtensionForEnumeration(token); !extension.isNull())
         checkin.emplace_back("extension", extension);

@@ -125,11 +125,16 @@ int main(int argc, char** argv) {
   static typhora::LinuxPlatform platform(options.root, options.runtimeDir);
   typhora::TyphoraDaemon::installPlatform(platform.bundle());
   typhora::TyphoraDaemon& daemon = typhora::TyphoraDaemon::sharedDaemon();
-  daemon.startUp();
   // The event socket opens after the service socket, which so keeps a lone unnamed activated
   // socket. An event that started the daemon waits in the socket's backlog until then, and in its
   // launch event stream until the daemon's handler is installed.
-  platform.startServices();
+  if (!daemon.startUp() || !platform.startServices()) {
+    // Threads already run: leave at once, without tearing down what they use.
+    std::fprintf(stderr, "typhorad: cannot open its sockets in runtime directory %s\n",
+                 options.runtimeDir.c_str());
+    std::fflush(stderr);
+    std::_Exit(EXIT_FAILURE);
+  }
   typhora::SystemLog("typhorad ready: device root %s, runtime directory %s", options.root,
                      options.runtimeDir);
   daemon.run();

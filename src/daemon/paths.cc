@@ -80,10 +80,23 @@ std::string_view parentDirectoryPath(std::string_view path) {
   return last == std::string_view::npos ? std::string_view() : path.substr(0, last);
 }
 
+namespace {
+
+// Takes the last path component off `rest` and answers it. Components are those of a URL's path:
+// empty ones, from "//" or a trailing "/", do not count.
+std::string_view takeLastComponent(std::string_view* rest) {
+  while (!rest->empty() && rest->back() == '/') rest->remove_suffix(1);
+  const std::size_t slash = rest->rfind('/');
+  const std::string_view last = slash == std::string_view::npos ? *rest : rest->substr(slash + 1);
+  *rest = slash == std::string_view::npos ? std::string_view() : rest->substr(0, slash);
+  return last;
+}
+
+}  // namespace
+
 std::string_view containingDirectoryName(std::string_view path) {
-  const std::string_view directory = parentDirectoryPath(path);
-  const std::size_t before = directory.rfind('/');
-  return before == std::string_view::npos ? directory : directory.substr(before + 1);
+  takeLastComponent(&path);
+  return takeLastComponent(&path);
 }
 
 }  // namespace typhora

@@ -24,8 +24,9 @@ bool isAssetStorePath(std::string_view path);
 
 // The path of the directory that holds the file at `path` (the path without its last component).
 std::string_view parentDirectoryPath(std::string_view path);
-// The name of the directory that directly holds the file at `path` (its last component after the
-// path's own last component is removed).
+// The name of the directory that directly holds the file at `path`: the last component left once
+// the path's own last component is removed, with components counted as a URL's path counts them
+// ("/d/p/" is in "d", "/d/p//f" in "p").
 std::string_view containingDirectoryName(std::string_view path);
 
 // What a file URL's path makes of a directory path: "." and empty components dropped, ".."

@@ -1,9 +1,9 @@
 #include "daemon/typhora_daemon.h"
 
-#include <cmath>
 #include <cstdlib>
 
 #include "platform/log.h"
+#include "platform/plist_number.h"
 
 namespace typhora {
 namespace {
@@ -13,12 +13,10 @@ constexpr std::int64_t kCurrentVersion = 1;
 
 Platform* installedPlatform = nullptr;
 
-// The stored version as an integer: a missing or non-numeric value reads as 0.
+// The stored version as an integer: a missing or non-numeric value reads as 0, and no number,
+// however large, reads as negative.
 std::int64_t storedVersion(const Value& v) {
-  if (auto i = v.asInt()) return *i;
-  if (auto d = v.asDouble(); d && std::isfinite(*d)) return static_cast<std::int64_t>(*d);
-  if (v.asUInt()) return INT64_MAX;
-  return 0;
+  return PlistNumber::integerValue(v).value_or(0);
 }
 
 }  // namespace
@@ -46,21 +44,27 @@ TyphoraDaemon& TyphoraDaemon::sharedDaemon() {
   return *daemon;
 }
 
-void TyphoraDaemon::startUp() {
-  setupForLumoService();
+bool TyphoraDaemon::startUp() {
+  if (!setupForLumoService()) return false;
   setupForScheduledFontDeletion();
   setupForDistributedNotifications();
   setupForBlacklistUpdatedNotification();
   setupForMonitoringFontAssets();
   setup();
+  return true;
 }
 
-void TyphoraDaemon::setupForLumoService() {
+bool TyphoraDaemon::setupForLumoService() {
   listener_ = platform_.ipc.makeNamedListener(kServiceName);
+  if (!listener_) {
+    TYLog_Error(kTYLogTyphoraDaemon, "cannot open the service %s", kServiceName);
+    return false;
+  }
   listener_->setDelegate(weak_from_this());
   listener_->resume();
   // From here on connections are admitted on IPC threads while start-up goes on.
   (void)isUserFontInstalled();  // preloads the user-fonts information before the first check-in
+  return true;
 }
 
 // Start-up steps whose subsystems arm nothing yet.

@@ -47,8 +47,9 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   static TyphoraDaemon& sharedDaemon();
 
   // Start-up steps 2 to 7, in their fixed order, on the main thread.
-  void startUp();
-  void setupForLumoService();
+  // False when the service cannot be opened: the daemon then has nothing to serve.
+  bool startUp();
+  bool setupForLumoService();
   void setupForScheduledFontDeletion();
   void setupForDistributedNotifications();
   void setupForBlacklistUpdatedNotification();
@@ -257,6 +258,10 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   void releaseRequestFontsGate(Duration after);
 
   SerialQueue& updateQueue();
+  // Scheduled deletion's steps, on scheduledFontDeletionQueue: adding to the pending table
+  // (bounded, refusing paths that are not plain), and removing the due files.
+  void addPendingDeletions(const std::vector<std::string>& paths, std::uint32_t delay);
+  void removeDueFontFiles(const std::vector<std::string>& due);
   // The cache, loaded from disk when absent. Called with userFontsInfoMutex_ held.
   const Value& loadedUserFontsInfoLocked();
   std::vector<std::string> issuedFontFilePathsLocked(const Dictionary* issues,

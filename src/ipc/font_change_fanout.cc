@@ -8,6 +8,7 @@
 #include "ipc/interface_descriptions.h"
 #include "ipc/typhora_handler.h"
 #include "platform/log.h"
+#include "platform/plist_number.h"
 
 namespace typhora {
 
@@ -47,8 +48,8 @@ void TyphoraHandler::observeFontChanges() {
 
 void TyphoraHandler::fontChanged(const Value& change) {
   TY_ASSERT_ON_QUEUE(server_->mainHandlerQueue());
-  const bool added = change.get("added").asBool().value_or(false);
-  const std::int64_t kind = change.get("kind").asInt().value_or(0);
+  const bool added = PlistNumber::boolValue(change.get("added")).value_or(false);
+  const std::int64_t kind = PlistNumber::integerValue(change.get("kind")).value_or(0);
   const ValueArray* urls = change.get("urls").asArray();
   const ValueArray none;
   if (kind == 0) {

@@ -9,6 +9,8 @@
 #include <ctime>
 #include <mutex>
 
+#include "platform/plist_number.h"
+
 namespace typhora {
 namespace {
 
@@ -98,13 +100,70 @@ void appendConversion(std::string* out, char conversion, const LogArg& arg) {
   } else if (auto* u = std::get_if<std::uint64_t>(&v)) {
     *out += std::to_string(*u);
   } else if (auto* d = std::get_if<double>(&v)) {
-    *out += conversion == 'f' ? std::to_string(*d) : std::to_string(static_cast<std::int64_t>(*d));
+    *out += conversion == 'f' ? std::to_string(*d)
+                              : std::to_string(PlistNumber::integerValue(Value(*d)).value_or(0));
   } else {
     *out += std::get<std::string>(v);
   }
 }
 
+// Whether the bytes at `i` start a character that must not reach a log line as it is: a C0 or C1
+// control or a line or paragraph separator. Answers its length in bytes, or 0.
+std::size_t controlAt(std::string_view text, std::size_t i) {
+  const auto byte = [&](std::size_t k) {
+    return k < text.size() ? static_cast<unsigned char>(text[k]) : 0u;
+  };
+  const unsigned c = byte(i);
+  if (c < 0x20 || c == 0x7f) return 1;
+  if (c == 0xc2 && byte(i + 1) >= 0x80 && byte(i + 1) <= 0x9f) return 2;
+  if (c == 0xe2 && byte(i + 1) == 0x80 && (byte(i + 2) == 0xa8 || byte(i + 2) == 0xa9)) return 3;
+  return 0;
+}
+
+void appendEscaped(std::string* out, std::string_view character) {
+  char buffer[16];
+  if (character.size() == 1) {
+    const auto c = static_cast<unsigned char>(character[0]);
+    if (c == '\n') {
+      *out += "\\n";
+    } else if (c == '\r') {
+      *out += "\\r";
+    } else if (c == '\t') {
+      *out += "\\t";
+    } else {
+      std::snprintf(buffer, sizeof buffer, "\\x%02x", c);
+      *out += buffer;
+    }
+    return;
+  }
+  const unsigned code = character.size() == 2
+                            ? static_cast<unsigned char>(character[1])
+                            : 0x2000u + (static_cast<unsigned char>(character[2]) & 0x3fu);
+  std::snprintf(buffer, sizeof buffer, "\\u%04x", code);
+  *out += buffer;
+}
+
 }  // namespace
+
+std::string escapeLogControls(std::string_view message) {
+  std::string out;
+  std::size_t copied = 0;
+  for (std::size_t i = 0; i < message.size();) {
+    const std::size_t length = controlAt(message, i);
+    if (length == 0) {
+      ++i;
+      continue;
+    }
+    if (out.empty()) out.reserve(message.size() + 16);
+    out.append(message.substr(copied, i - copied));
+    appendEscaped(&out, message.substr(i, length));
+    i += length;
+    copied = i;
+  }
+  if (copied == 0) return std::string(message);
+  out.append(message.substr(copied));
+  return out;
+}
 
 std::string formatLog(std::string_view format, std::initializer_list<LogArg> args) {
   std::string out;
@@ -165,7 +224,8 @@ std::shared_ptr<LogSink> makeJournalLogSink() {
 void logWrite(LogLevel level, const LogCategory* category, std::string_view format,
               std::initializer_list<LogArg> args) {
   if (level < minimumLevel.load()) return;
-  std::string message = formatLog(format, args);
+  // Whatever the arguments carry, one call writes one line.
+  std::string message = escapeLogControls(formatLog(format, args));
   std::shared_ptr<LogSink> sink;
   {
     std::lock_guard lock(sinkMutex());

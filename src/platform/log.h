@@ -61,6 +61,9 @@ class LogArg {
 };
 
 std::string formatLog(std::string_view format, std::initializer_list<LogArg> args);
+// `message` with every control character (C0, C1, DEL, line and paragraph separators) written as
+// an escape ("\n", "\x1b", "\u0085"), so that it stays one line whatever it quotes.
+std::string escapeLogControls(std::string_view message);
 
 // Installs the sink for every later line (nullptr: back to stderr). Returns the previous one.
 std::shared_ptr<LogSink> setLogSink(std::shared_ptr<LogSink> sink);

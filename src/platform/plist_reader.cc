@@ -1,15 +1,10 @@
 #include "platform/plist_reader.h"
 
-#include <fcntl.h>
 #include <sys/mman.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
-#include <cerrno>
-#include <cstring>
 
 #include "platform/cbor_codec.h"
 #include "platform/json_codec.h"
+#include "platform/regular_file.h"
 
 namespace typhora {
 
@@ -69,40 +64,16 @@ std::optional<Value> PlistReader::readFile(const std::string& path, const Decode
     if (error != nullptr) *error = std::move(why);
     return std::nullopt;
   };
-  int fd = open(path.c_str(), O_RDONLY | O_CLOEXEC);
-  if (fd < 0) return failWith(std::string("cannot open: ") + std::strerror(errno));
-  struct stat info {};
-  if (fstat(fd, &info) != 0) {
-    const int savedErrno = errno;
-    close(fd);
-    return failWith(std::string("cannot read: ") + std::strerror(savedErrno));
-  }
-  if (static_cast<std::uint64_t>(info.st_size) > limits.maxBytes) {
-    close(fd);
-    return failWith("file larger than the size limit");
-  }
-  FileBytes buffer(static_cast<std::size_t>(info.st_size));
-  if (!buffer.valid()) {
-    close(fd);
-    return failWith("cannot read: out of memory");
-  }
-  std::span<std::uint8_t> bytes = buffer.span();
+  std::size_t size = 0;
+  UniqueFd fd = RegularFile::open(path, limits.maxBytes, &size, error);
+  if (!fd.valid()) return std::nullopt;
+  FileBytes buffer(size);
+  if (!buffer.valid()) return failWith("cannot read: out of memory");
   std::size_t done = 0;
-  bool ok = true;
-  while (done < bytes.size()) {
-    ssize_t n = ::read(fd, bytes.data() + done, bytes.size() - done);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) {
-      ok = n == 0;  // the file shrank while being read: decode what is there
-      break;
-    }
-    done += static_cast<std::size_t>(n);
-  }
-  const int savedErrno = errno;
-  close(fd);
-  if (!ok) return failWith(std::string("cannot read: ") + std::strerror(savedErrno));
+  if (!RegularFile::readInto(fd.get(), buffer.span(), &done, error)) return std::nullopt;
+  const std::span<const std::uint8_t> bytes = buffer.span().first(done);
   std::string why;
-  auto value = read(bytes.first(done), limits, &why);
+  auto value = read(bytes, limits, &why);
   if (!value) return failWith("cannot decode: " + why);
   return value;
 }

@@ -59,14 +59,17 @@ TEST_P(MigrationTest, ResetsAndWritesVersionOneOnlyBelowOne) {
   }
 }
 
-INSTANTIATE_TEST_SUITE_P(Versions, MigrationTest,
-                         ::testing::Values(MigrationCase{"absent", Value(), true},
-                                           MigrationCase{"minus1", Value(-1), true},
-                                           MigrationCase{"zero", Value(0), true},
-                                           MigrationCase{"one", Value(1), false},
-                                           MigrationCase{"five", Value(5), false},
-                                           MigrationCase{"text", Value("7"), true}),
-                         [](const auto& testCase) { return std::string(testCase.param.name); });
+INSTANTIATE_TEST_SUITE_P(
+    Versions, MigrationTest,
+    ::testing::Values(MigrationCase{"absent", Value(), true},
+                      MigrationCase{"minus1", Value(-1), true},
+                      MigrationCase{"zero", Value(0), true}, MigrationCase{"one", Value(1), false},
+                      MigrationCase{"five", Value(5), false},
+                      MigrationCase{"text", Value("7"), true},
+                      MigrationCase{"twoTo63", Value(std::uint64_t{1} << 63), false},
+                      MigrationCase{"hugeDouble", Value(1e300), false},
+                      MigrationCase{"minusHugeDouble", Value(-1e300), true}),
+    [](const auto& testCase) { return std::string(testCase.param.name); });
 
 // ---- The one daemon ----
 

@@ -3,6 +3,12 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <iterator>
+
 #include "integration/daemon_test_base.h"
 
 namespace typhora::testing {
@@ -44,6 +50,36 @@ TEST_F(CheckinProcessTest, EachApplicationGetsWhatItsEntitlementsOpen) {
   auto unsigned_ = ctl({"call", "checkin:"});
   ASSERT_EQ(unsigned_.status, 0) << unsigned_.all;
   EXPECT_EQ(unsigned_.out, "[null]\n");
+}
+
+// Its owner changes a signed program's bytes in place and puts its modification time back: the
+// daemon hashes it again and no longer takes it for the application.
+TEST_F(CheckinProcessTest, AProgramChangedInPlaceLosesItsIdentity) {
+  const std::string shop = install("shop", "com.example.shop", R"(["system-installation"])");
+  startDaemon();
+  auto signed_ = checkin(shop);
+  ASSERT_THAT(signed_.out, HasSubstr(R"("extension.provider")")) << signed_.all;
+
+  struct stat before {};
+  ASSERT_EQ(stat(shop.c_str(), &before), 0);
+  std::string bytes;
+  {
+    std::ifstream in(shop, std::ios::binary);
+    bytes.assign(std::istreambuf_iterator<char>(in), {});
+  }
+  // A letter of the usage text: the program still runs.
+  const std::size_t at = bytes.find("usage: typhoractl");
+  ASSERT_NE(at, std::string::npos);
+  const int fd = open(shop.c_str(), O_WRONLY);
+  ASSERT_GE(fd, 0);
+  ASSERT_EQ(pwrite(fd, "U", 1, static_cast<off_t>(at)), 1);
+  close(fd);
+  const timespec times[2] = {before.st_atim, before.st_mtim};
+  ASSERT_EQ(utimensat(AT_FDCWD, shop.c_str(), times, 0), 0);
+
+  auto changed = checkin(shop);
+  ASSERT_EQ(changed.status, 0) << changed.all;
+  EXPECT_EQ(changed.out, "[null]\n");
 }
 
 }  // namespace

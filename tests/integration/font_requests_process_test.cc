@@ -44,6 +44,12 @@ class FontRequestsProcessTest : public DaemonTestBase {
         << "{\"" << kA << R"(": {"familyName": {"A-Regular": "A"}}, ")" << kB1
         << R"(": {"familyName": {"B-Regular": "B"}, "disabled": true}, ")" << kB2
         << R"(": {"familyName": {"B-Italic": "B"}, "disabled": true}})";
+    // The registry names a provider only for a provider directory that is there.
+    for (const char* font : {kA, kB1, kB2}) {
+      const fs::path file = root_ / std::string(font).substr(1);
+      fs::create_directories(file.parent_path());
+      std::ofstream(file) << "font";
+    }
   }
 
   // The view service the daemon starts: `script` runs in sh with the daemon's arguments.

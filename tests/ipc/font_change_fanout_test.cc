@@ -116,6 +116,23 @@ TEST_F(FanoutTest, AdditionsReachThoseWhoMaySeeThemWithTheirFontsAndTokens) {
   EXPECT_EQ(messages(provider_).size(), 1u);
 }
 
+TEST_F(FanoutTest, ChangesReadNumbersAndUrlDirectoriesTheWayPropertyListsAndUrlsDo) {
+  // "added": 1 is an addition. A provider's font is found by its URL's path components: a
+  // directory URL lies in "FontFiles", a doubled separator changes nothing.
+  change(R"({"added": 1, "kind": 0.0, "urls": [
+      "file:///var/mobile/Library/UserFonts/FontFiles/com.shop//A.otf",
+      "file:///var/mobile/Library/UserFonts/FontFiles/com.shop/"]})");
+  auto shop = messages(provider_);
+  ASSERT_EQ(shop.size(), 1u);
+  EXPECT_EQ(shop[0][1],
+            json(R"(["file:///var/mobile/Library/UserFonts/FontFiles/com.shop//A.otf"])"));
+  EXPECT_TRUE(shop[0][2].isNull());
+
+  // "kind": 1.0 is a profile change, which reaches a client without any capability.
+  change(R"({"added": true, "kind": 1.0, "urls": []})");
+  EXPECT_EQ(messages(plain_).size(), 1u);
+}
+
 TEST_F(FanoutTest, ProfileChangesReachEveryCheckedInClient) {
   fake_.fontManager.setProfileFontsInfo(json(
       R"({"/var/mobile/Library/Fonts/P.ttf": {"n": 1}, "/var/mobile/Library/Fonts/Q.ttf": {}})"));

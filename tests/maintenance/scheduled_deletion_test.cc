@@ -133,6 +133,22 @@ TEST_F(ScheduledDeletionTest, ARunDeletesWhatIsNearlyDueAndArmsForTheRest) {
   EXPECT_FALSE(fake_.fileSystem.fileExists(kFiles + "a"));
 }
 
+TEST_F(ScheduledDeletionTest, ARunKeepsBelowTheFontDirectories) {
+  fake_.fileSystem.writeFile(kFiles + "lonely/A.otf", "x");
+  fake_.fileSystem.writeFile("/var/mobile/Library/UserFonts/UserFonts.plist", "{}");
+  // The second entry was stored before such paths were refused.
+  setTable({{kFiles + "lonely", dueIn(0)}, {kFiles + "../UserFonts.plist", dueIn(0)}});
+  LogCapture log;
+  daemon_->setFontFilesDeletionTimer(0);
+  advance(0s);
+  // The emptied font-files directory itself stays.
+  EXPECT_THAT(fake_.fileSystem.removed(), ElementsAre(kFiles + "lonely"));
+  EXPECT_EQ(
+      log.count("executeScheduledFontFilesDeletion: dropped 1 entries that are not plain paths"),
+      1u);
+  EXPECT_EQ(table(), Value(Dictionary()));
+}
+
 TEST_F(ScheduledDeletionTest, EntriesFarOffOnlyMoveTheTimer) {
   setTable({{kFiles + "a/A.otf", dueIn(1000.7)}, {kFiles + "a/B.otf", dueIn(5000)}});
   LogCapture log;

@@ -262,5 +262,20 @@ TEST(Log, FormatsConversionsAndFiltersLevels) {
   EXPECT_EQ(log.count("dropped"), 0u);
 }
 
+TEST(Log, ArgumentsCannotEndTheLineOrForgeAnother) {
+  testing::LogCapture log;
+  // Newlines, escapes, C1 controls and separators, and a huge double for "%d".
+  const std::string text(
+      "a\nb\r\x1b[2K\0c\xc2\x85"
+      "d\xe2\x80\xa8"
+      "e\x7f\xc3\xa9",
+      20);
+  SystemLog("refused %@ after %d", text, 1e300);
+  ASSERT_EQ(log.lines().size(), 1u);
+  EXPECT_EQ(log.lines()[0].message,
+            "refused a\\nb\\r\\x1b[2K\\x00c\\u0085d\\u2028e\\x7f\xc3\xa9 after "
+            "9223372036854775807");
+}
+
 }  // namespace
 }  // namespace typhora

@@ -211,6 +211,11 @@ TEST_F(LinuxFontRegistryTest, EnablesDisablesAndRemovesProviders) {
   EXPECT_EQ(registry_.directoryNameFromIdentifier("com.example.b"), "com.example.b");
   EXPECT_EQ(registry_.directoryNameFromIdentifier("a/b"), std::nullopt);
   EXPECT_EQ(registry_.identifierFromDirectoryName(""), std::nullopt);
+  // Only a provider's directory under FontFiles/ names a provider.
+  root_.write("var/mobile/Library/UserFonts/FontAssets/Serif/Serif.ttf", "s");
+  EXPECT_EQ(registry_.identifierFromDirectoryName("com.example.b"), "com.example.b");
+  for (const char* other : {"com.example.a", "Serif", "AssetData", "FontFiles", "Fonts"})
+    EXPECT_EQ(registry_.identifierFromDirectoryName(other), std::nullopt) << other;
 }
 
 }  // namespace

@@ -1,5 +1,7 @@
 #include "support/fake_file_system.h"
 
+#include <algorithm>
+
 #include "platform/plist_reader.h"
 
 namespace typhora::testing {
@@ -83,6 +85,22 @@ bool FakeFileSystem::removeItem(const std::string& path, std::string* error) {
   std::erase_if(files_, [&](const auto& entry) { return isBelow(entry.first, path); });
   std::erase_if(directories_, [&](const auto& directory) { return isBelow(directory, path); });
   return true;
+}
+
+bool FakeFileSystem::removeEmptyDirectory(const std::string& path, std::string* error) {
+  {
+    std::lock_guard lock(mutex_);
+    const bool hasChildren =
+        std::any_of(files_.begin(), files_.end(),
+                    [&](const auto& entry) { return isBelow(entry.first, path); }) ||
+        std::any_of(directories_.begin(), directories_.end(),
+                    [&](const auto& directory) { return isBelow(directory, path); });
+    if (!isDirectoryLocked(path) || hasChildren) {
+      if (error != nullptr) *error = hasChildren ? "Directory not empty" : "Not a directory";
+      return false;
+    }
+  }
+  return removeItem(path, error);
 }
 
 std::optional<std::vector<std::string>> FakeFileSystem::contentsOfDirectory(

@@ -27,6 +27,7 @@ class FakeFileSystem final : public FileSystem {
   bool fileExists(const std::string& path) const override;
   std::optional<Value> readPropertyList(const std::string& path, std::string* error) const override;
   bool removeItem(const std::string& path, std::string* error) override;
+  bool removeEmptyDirectory(const std::string& path, std::string* error) override;
   std::optional<std::vector<std::string>> contentsOfDirectory(
       const std::string& path) const override;
 

@@ -19,6 +19,7 @@ namespace typhora {
 namespace {
 
 constexpr std::size_t kMaxManifests = 4096;
+constexpr std::size_t kMaxCachedDigests = 1024;
 
 std::optional<std::string> sha256Hex(int fd) {
   crypto_hash_sha256_state state;
@@ -37,6 +38,18 @@ std::optional<std::string> sha256Hex(int fd) {
   sodium_bin2hex(hex.data(), hex.size(), digest.data(), digest.size());
   return std::string(hex.data());
 }
+
+}  // namespace
+
+std::optional<AppManifestStore::ProgramKey> AppManifestStore::programKey(int fd) {
+  struct stat info {};
+  if (fstat(fd, &info) != 0 || !S_ISREG(info.st_mode)) return std::nullopt;
+  return ProgramKey{info.st_dev,         info.st_ino,          info.st_size,
+                    info.st_mtim.tv_sec, info.st_mtim.tv_nsec, info.st_ctim.tv_sec,
+                    info.st_ctim.tv_nsec};
+}
+
+namespace {
 
 bool sameTime(const timespec& a, const timespec& b) {
   return a.tv_sec == b.tv_sec && a.tv_nsec == b.tv_nsec;
@@ -88,19 +101,22 @@ std::shared_ptr<const AppManifestStore::Manifests> AppManifestStore::load() cons
 std::optional<std::string> AppManifestStore::digestOfProgram(const AuditToken& token) const {
   // The program the process runs, opened through the process itself: a file replaced on disk
   // since then is not what gets hashed.
-  UniqueFd fd(open(("/proc/" + std::to_string(token.pid) + "/exe").c_str(), O_RDONLY | O_CLOEXEC));
-  struct stat info {};
-  if (!fd.valid() || fstat(fd.get(), &info) != 0) return std::nullopt;
-  if (info.st_dev != token.exeDevice || info.st_ino != token.exeInode) return std::nullopt;
-  ProgramKey key{info.st_dev, info.st_ino, info.st_size, info.st_mtim.tv_sec, info.st_mtim.tv_nsec};
+  UniqueFd fd(open(("/proc/" + std::to_string(token.pid) + "/exe").c_str(),
+                   O_RDONLY | O_NONBLOCK | O_CLOEXEC));
+  std::optional<ProgramKey> key = fd.valid() ? programKey(fd.get()) : std::nullopt;
+  if (!key || std::get<0>(*key) != token.exeDevice || std::get<1>(*key) != token.exeInode)
+    return std::nullopt;
   {
     std::lock_guard lock(mutex_);
-    if (auto it = digests_.find(key); it != digests_.end()) return it->second;
+    if (auto it = digests_.find(*key); it != digests_.end()) return it->second;
   }
   std::optional<std::string> digest = sha256Hex(fd.get());
   if (!digest) return std::nullopt;
+  // A file changed while it was hashed gives a digest of neither version: not kept.
+  if (programKey(fd.get()) != key) return std::nullopt;
   std::lock_guard lock(mutex_);
-  digests_[key] = *digest;
+  if (digests_.size() >= kMaxCachedDigests) digests_.clear();
+  digests_[*key] = *digest;
   return digest;
 }
 

@@ -39,8 +39,10 @@ class AppManifestStore {
   mutable std::mutex mutex_;
   mutable std::optional<timespec> loadedModified_;
   mutable std::shared_ptr<const Manifests> manifests_;
-  // SHA-256 of programs by (device, inode, size, modification time).
-  using ProgramKey = std::tuple<dev_t, ino_t, off_t, std::int64_t, long>;
+  // SHA-256 of programs by (device, inode, size, modification time, change time). The owner of a
+  // file can set its modification time back after changing it, but not its change time.
+  using ProgramKey = std::tuple<dev_t, ino_t, off_t, std::int64_t, long, std::int64_t, long>;
+  static std::optional<ProgramKey> programKey(int fd);
   mutable std::map<ProgramKey, std::string> digests_;
 };
 

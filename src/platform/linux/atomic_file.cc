@@ -28,7 +28,9 @@ bool AtomicFile::write(const std::string& path, std::span<const std::uint8_t> by
   std::error_code ec;
   std::filesystem::create_directories(target.parent_path(), ec);
   const std::string temporary = path + ".tmp-" + std::to_string(getpid());
-  UniqueFd fd(open(temporary.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, mode));
+  // Never through a link or into a FIFO left at the temporary name.
+  UniqueFd fd(open(temporary.c_str(),
+                   O_WRONLY | O_CREAT | O_TRUNC | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, mode));
   bool ok = fd.valid() && writeAll(fd.get(), bytes) && fsync(fd.get()) == 0;
   fd.reset();
   ok = ok && rename(temporary.c_str(), path.c_str()) == 0;

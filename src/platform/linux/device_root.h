@@ -12,6 +12,8 @@ class DeviceRoot {
   explicit DeviceRoot(std::string root) : prefix_(std::move(root)) {
     while (!prefix_.empty() && prefix_.back() == '/') prefix_.pop_back();
   }
+  // The root directory's machine path.
+  std::string path() const { return prefix_.empty() ? std::string("/") : prefix_; }
   // The machine path of the daemon's absolute path `path`.
   std::string onDisk(std::string_view path) const { return prefix_ + std::string(path); }
   // Whether `name` can stand for exactly one entry of a directory: not empty, not "." or "..",

@@ -29,7 +29,11 @@ bool isDirectory(const std::string& path) {
 }
 
 std::string join(const std::string& dir, const char* name) {
-  return dir == "/" ? "/" + std::string(name) : dir + "/" + name;
+  // Appended in place: g++ 12 at -O3 takes "/" + std::string(name) for an overlapping copy.
+  std::string path = dir == "/" ? std::string() : dir;
+  path += '/';
+  path += name;
+  return path;
 }
 
 std::string parentOf(const std::string& path) {

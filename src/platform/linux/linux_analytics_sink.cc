@@ -1,6 +1,7 @@
 #include "platform/linux/linux_analytics_sink.h"
 
 #include <fcntl.h>
+#include <sys/stat.h>
 
 #include <filesystem>
 
@@ -28,9 +29,13 @@ void LinuxAnalyticsSink::sendEvent(const std::string& name, const Builder& build
   std::error_code ec;
   std::filesystem::create_directories(std::filesystem::path(path_).parent_path(), ec);
   // One write of the whole line with O_APPEND: lines of concurrent writers never interleave.
-  UniqueFd fd(open(path_.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0640));
+  // Only into a regular file: a FIFO in its place neither blocks the open nor takes the line.
+  UniqueFd fd(open(path_.c_str(),
+                   O_WRONLY | O_APPEND | O_CREAT | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC, 0640));
+  struct stat info {};
   const auto* bytes = reinterpret_cast<const std::uint8_t*>(line.data());
-  if (!fd.valid() || !AtomicFile::writeAll(fd.get(), {bytes, line.size()}))
+  if (!fd.valid() || fstat(fd.get(), &info) != 0 || !S_ISREG(info.st_mode) ||
+      !AtomicFile::writeAll(fd.get(), {bytes, line.size()}))
     TYLog_Error(kTYLogTyphoraDaemon, "analytics: cannot append to %@", path_);
 }
 

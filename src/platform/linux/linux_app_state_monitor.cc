@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <sys/file.h>
 
+#include <climits>
 #include <cstdlib>
 #include <filesystem>
 #include <vector>
@@ -39,7 +40,9 @@ int LinuxAppStateMonitor::mostElevatedApplicationState(pid_t pid) const {
   if (!table) return kApplicationStateUnknown;
   const Value& entry = table->get(std::to_string(pid));
   std::optional<std::int64_t> state = entry.get("state").asInt();
-  if (!state || !isCurrent(pid, entry)) return kApplicationStateUnknown;
+  // A state outside int's range is no state at all (it must not wrap into one).
+  if (!state || *state < INT_MIN || *state > INT_MAX || !isCurrent(pid, entry))
+    return kApplicationStateUnknown;
   return static_cast<int>(*state);
 }
 
@@ -53,7 +56,8 @@ bool LinuxAppStateMonitor::setState(pid_t pid, std::optional<int> state, std::st
   // replaced whole.
   std::error_code ec;
   std::filesystem::create_directories(std::filesystem::path(path_).parent_path(), ec);
-  UniqueFd lock(open((path_ + ".lock").c_str(), O_RDONLY | O_CREAT | O_CLOEXEC, 0600));
+  UniqueFd lock(open((path_ + ".lock").c_str(),
+                     O_RDONLY | O_CREAT | O_NONBLOCK | O_NOFOLLOW | O_CLOEXEC, 0600));
   if (lock.valid()) flock(lock.get(), LOCK_EX);
 
   std::vector<DictionaryEntry> entries;

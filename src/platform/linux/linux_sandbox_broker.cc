@@ -135,9 +135,12 @@ std::optional<LinuxSandboxBroker::Key> LinuxSandboxBroker::loadOrCreateKey() con
   const std::string directory = root_.onDisk("/etc/typhora");
   const std::string path = directory + "/sandbox.key";
   Key key{};
-  UniqueFd existing(open(path.c_str(), O_RDONLY | O_CLOEXEC));
-  if (existing.valid()) {
-    if (readAll(existing.get(), key.data(), key.size())) return key;
+  UniqueFd existing(open(path.c_str(), O_RDONLY | O_NONBLOCK | O_NOFOLLOW | O_CLOEXEC));
+  if (existing.valid() || errno == ELOOP) {
+    struct stat info {};
+    if (existing.valid() && fstat(existing.get(), &info) == 0 && S_ISREG(info.st_mode) &&
+        readAll(existing.get(), key.data(), key.size()))
+      return key;
     TYLog_Error(kTYLogTyphoraDaemon, "sandbox: key %@ is unreadable or short", path);
     return std::nullopt;
   }

@@ -1,5 +1,7 @@
 #include "platform/linux/linux_user_font_manager.h"
 
+#include <sys/stat.h>
+
 #include <filesystem>
 #include <map>
 #include <set>
@@ -8,6 +10,7 @@
 #include "platform/linux/atomic_file.h"
 #include "platform/linux/device_root.h"
 #include "platform/linux/font_face_names.h"
+#include "platform/regular_file.h"
 #include "platform/log.h"
 #include "platform/plist_reader.h"
 
@@ -27,6 +30,7 @@ constexpr const char* kFontFiles = "/var/mobile/Library/UserFonts/FontFiles/";
 constexpr const char* kFontAssets = "/var/mobile/Library/UserFonts/FontAssets/";
 constexpr const char* kAssetStore = "/private/var/Cargell/AssetsV2/com_zorvane_Cargell_Font6/";
 constexpr const char* kFileUrlScheme = "file://";
+constexpr std::size_t kMaxMirroredBytes = 256u << 20;
 
 std::vector<DictionaryEntry> entriesOf(const Value& info) {
   const Dictionary* dictionary = info.asDictionary();
@@ -52,7 +56,9 @@ std::vector<std::string> subdirectories(const std::string& machinePath) {
 }  // namespace
 
 LinuxUserFontManager::LinuxUserFontManager(std::string root)
-    : root_(std::move(root)), queue_(SerialQueue::create("com.zorvane.typhora.fontRegistry")) {}
+    : root_(root),
+      files_(std::move(root)),
+      queue_(SerialQueue::create("com.zorvane.typhora.fontRegistry")) {}
 
 void LinuxUserFontManager::reset() {
   std::error_code ec;
@@ -71,7 +77,12 @@ std::optional<std::string> LinuxUserFontManager::directoryNameFromIdentifier(
 
 std::optional<std::string> LinuxUserFontManager::identifierFromDirectoryName(
     const std::string& name) {
-  return DeviceRoot::isSingleComponent(name) ? std::optional(name) : std::nullopt;
+  // Only a provider's own directory: asset, asset-data and other directories name no provider.
+  struct stat info {};
+  if (!DeviceRoot::isSingleComponent(name) ||
+      lstat(root_.onDisk(kFontFiles + name).c_str(), &info) != 0 || !S_ISDIR(info.st_mode))
+    return std::nullopt;
+  return name;
 }
 
 Value LinuxUserFontManager::readInfo(const char* path) const {
@@ -123,9 +134,10 @@ std::optional<std::string> LinuxUserFontManager::removeProviderLocked(
   std::string error;
   if (entries.size() != before && !writeInfoLocked(Value(Dictionary(std::move(entries))), &error))
     return error;
-  std::error_code ec;
-  fs::remove_all(root_.onDisk(prefix), ec);
-  if (ec) return ec.message();
+  // The directory itself goes, never what a link in its place points to.
+  if (files_.fileExists(kFontFiles + *directory) &&
+      !files_.removeItem(kFontFiles + *directory, &error))
+    return error;
   return std::nullopt;
 }
 
@@ -192,13 +204,11 @@ bool LinuxUserFontManager::mirrorAssetsLocked() {
     std::error_code ec;
     fs::create_directories(fs::path(target).parent_path(), ec);
     if (!fs::exists(target, ec)) {
-      const std::string temporary = target + ".partial";
-      ec.clear();
-      fs::copy_file(store, temporary, fs::copy_options::overwrite_existing, ec);
-      if (!ec) fs::rename(temporary, target, ec);
-      if (ec) {
-        TYLog_Error(kTYLogTyphoraDaemon, "font registry: cannot mirror %@: %@", store,
-                    ec.message());
+      std::string error;
+      std::optional<std::vector<std::uint8_t>> bytes =
+          RegularFile::read(store, kMaxMirroredBytes, &error);
+      if (!bytes || !AtomicFile::write(target, *bytes, 0644, &error)) {
+        TYLog_Error(kTYLogTyphoraDaemon, "font registry: cannot mirror %@: %@", store, error);
         ok = false;
         continue;
       }
@@ -218,8 +228,8 @@ bool LinuxUserFontManager::mirrorAssetsLocked() {
     bool stillWanted = std::any_of(wanted.begin(), wanted.end(), [&](const auto& entry) {
       return entry.first.starts_with(prefix);
     });
-    std::error_code ec;
-    if (!stillWanted) fs::remove_all(root_.onDisk(prefix), ec);
+    std::string ignored;
+    if (!stillWanted) files_.removeItem(kFontAssets + asset, &ignored);
   }
   Value info(Dictionary(std::vector<DictionaryEntry>(kept.begin(), kept.end())));
   std::string error;

@@ -17,6 +17,7 @@
 #include <string>
 
 #include "platform/linux/device_root.h"
+#include "platform/linux/linux_file_system.h"
 #include "platform/serial_queue.h"
 #include "platform/ty_user_font_manager.h"
 
@@ -31,6 +32,7 @@ class LinuxUserFontManager final : public TYUserFontManager {
   // A provider's directory is named after its identifier; names that cannot be one directory
   // ("", ".", "..", anything with "/") have none.
   std::optional<std::string> directoryNameFromIdentifier(const std::string& identifier) override;
+  // The identifier of a provider whose directory exists under FontFiles/, else none.
   std::optional<std::string> identifierFromDirectoryName(const std::string& name) override;
   Value profileFontsInfo() override;
   Value userFontsInfo() override;
@@ -49,7 +51,8 @@ class LinuxUserFontManager final : public TYUserFontManager {
   bool mirrorAssetsLocked();
 
   DeviceRoot root_;
-  std::mutex mutex_;  // every change to the registry's files
+  LinuxFileSystem files_;  // removals beneath the root, never through a link
+  std::mutex mutex_;       // every change to the registry's files
   std::shared_ptr<SerialQueue> queue_;
 };
 
