@@ -11,6 +11,7 @@
 #include <thread>
 
 #include "platform/linux/lumo_frame.h"
+#include "platform/linux/lumo_admission.h"
 #include "platform/linux/lumo_service.h"
 
 namespace typhora {
@@ -163,6 +164,8 @@ void BM_ThousandIdleConnections(benchmark::State& state) {
     std::this_thread::sleep_for(std::chrono::seconds(6));  // let idle pool workers leave
     const long rssBefore = statusField("VmRSS:");
     const long threadsBefore = statusField("Threads:");
+    // One user's thousand connections: past what a service lets one user hold.
+    LumoAdmission::shared().setLimits({2000, 64, 128u << 20, 64});
     std::vector<std::shared_ptr<IpcConnection>> connections;
     auto proxyOf = [](auto& c) { return c->synchronousRemoteObjectProxy([](const std::string&) {}); };
     for (int i = 0; i < 1000; ++i) {
@@ -174,6 +177,7 @@ void BM_ThousandIdleConnections(benchmark::State& state) {
         static_cast<double>(statusField("VmRSS:") - rssBefore) / 1000.0;
     state.counters["threads_added"] = static_cast<double>(statusField("Threads:") - threadsBefore);
     for (auto& c : connections) c->invalidate();
+    LumoAdmission::shared().setLimits({});
     state.ResumeTiming();
   }
 }
