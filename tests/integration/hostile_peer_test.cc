@@ -69,20 +69,14 @@ class HostilePeerTest : public DaemonTestBase {
     return std::chrono::duration<double, std::milli>(Clock::now() - start).count();
   }
 
-  // A copy of typhoractl that a manifest signs as an application allowed to enumerate fonts.
+  // A copy of typhoractl signed as an application allowed to enumerate fonts, which other users
+  // may run too.
   std::string installEnumeratingApp() {
-    const fs::path program = dir_ / "apps" / "reader";
-    fs::create_directories(program.parent_path());
-    fs::copy_file(kCtl, program);
-    auto digest = runCommand({"/usr/bin/sha256sum", program.string()}, 20s);
-    fs::create_directories(root_ / "etc/typhora/apps");
-    std::ofstream(root_ / "etc/typhora/apps/reader.plist")
-        << R"({"identifier": "com.example.reader", "executable": ")" << program.string()
-        << R"(", "sha256": ")" << digest.out.substr(0, 64)
-        << R"(", "entitlements": {"com.zorvane.developer.user-fonts": ["font-enumeration"]}})";
-    // Other users run it too.
+    const std::string program = installApp(
+        "reader", "com.example.reader",
+        R"({"com.zorvane.developer.user-fonts": ["font-enumeration"]})", false);
     for (const fs::path& p : {dir_, dir_ / "apps", runtime_}) chmod(p.c_str(), 0755);
-    return program.string();
+    return program;
   }
 };
 
