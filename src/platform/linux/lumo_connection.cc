@@ -120,13 +120,19 @@ std::shared_ptr<LumoConnection> LumoConnection::adopt(UniqueFd fd, ProcessPin pe
   connection->pin_ = std::move(peer);
   connection->admitted_ = true;
   connection->handshake_ = Handshake::AwaitingAck;
-  LumoAdmission::shared().awaitHello(connection->pin_.token().uid, connection);
-  // The peer's identity is read: from now on its frames may count, once they carry the nonce.
   getrandom(connection->nonce_.data(), connection->nonce_.size(), 0);
-  std::string error;
-  if (!connection->send(helloWith(connection->nonce_), &error)) return connection;
-  connection->armHandshakeLimit();
   return connection;
+}
+
+void LumoConnection::greet() {
+  // The peer's identity is read and the connection is read from now on: its frames may count
+  // once they carry the nonce. The hello goes out only now, so a peer's handshake never waits on
+  // the listener's delegate, and a client opening connections one handshake at a time is paced
+  // by how fast they are admitted.
+  LumoAdmission::shared().awaitHello(pin_.token().uid,
+                                     std::static_pointer_cast<LumoConnection>(shared_from_this()));
+  std::string error;
+  send(helloWith(nonce_), &error);
 }
 
 std::shared_ptr<LumoConnection> LumoConnection::toPath(std::string path) {
@@ -252,7 +258,8 @@ void LumoConnection::resume() {
     end(error, false);
     return;
   }
-  if (outgoing_) armHandshakeLimit();
+  if (!outgoing_) greet();
+  armHandshakeLimit();
 }
 
 void LumoConnection::invalidate() {

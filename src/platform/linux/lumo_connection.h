@@ -11,10 +11,10 @@
 // synchronous call made from the connection's own queue cannot deadlock and never needs a free
 // worker.
 //
-// Handshake: the accepting side pins its peer's identity, then sends a Hello with a fresh
-// nonce; the connecting side's first frame must be a Hello carrying that nonce back, so no frame
-// written before the identity was read counts. The connecting side holds its outgoing frames
-// until the Hello has come and pins the process that wrote it.
+// Handshake: the accepting side pins its peer's identity, then (once resumed) sends a Hello
+// with a fresh nonce; the connecting side's first frame must be a Hello carrying that nonce back,
+// so no frame written before the identity was read counts. The connecting side holds its outgoing
+// frames until the Hello has come and pins the process that wrote it.
 //
 // Writing: frames are queued with a byte bound and written without blocking; a peer that stops
 // reading until the bound is reached is cut off. Calls of a connection that ended are dropped,
@@ -94,6 +94,7 @@ class LumoConnection final : public IpcConnection {
 
   explicit LumoConnection(bool outgoing);
   bool connectNow(std::string* error);
+  void greet();
   void armHandshakeLimit();
   // I/O thread.
   void onEvents(std::uint32_t events);
