@@ -27,7 +27,7 @@ TEST_F(DaemonProcessTest, ClientsAreAnsweredAndEachLeavesOneHandlerBehind) {
   ASSERT_EQ(result.status, 0) << result.all << daemon_->output();
   EXPECT_EQ(result.out, "{}\n");
 
-  ASSERT_TRUE(daemon_->waitForLine("TyphoraHandler deallocated.", 10s)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLine("TyphoraHandler deallocated.", 30s)) << daemon_->output();
   std::this_thread::sleep_for(200ms);
   EXPECT_EQ(daemon_->countLines("TyphoraHandler deallocated."), 1u) << daemon_->output();
 
@@ -50,11 +50,11 @@ TEST_F(DaemonProcessTest, RefusedOperationsLeaveTheDaemonServing) {
   // Not an operation of the service at all: refused by the IPC layer before any handler runs.
   auto unknown = ctl({"call", "--unchecked", "eraseAllFonts:"});
   EXPECT_NE(unknown.status, 0) << unknown.all;
-  EXPECT_TRUE(daemon_->waitForLine("lumo error:", 5s)) << daemon_->output();
+  EXPECT_TRUE(daemon_->waitForLine("lumo error:", 30s)) << daemon_->output();
 
   // A wrong argument type is refused the same way.
   auto wrongType = ctl({"call", "--unchecked", "scheduleFontFilesDeletion:", "42"});
-  EXPECT_TRUE(daemon_->waitForLine("scheduleFontFilesDeletion:", 5s)) << daemon_->output();
+  EXPECT_TRUE(daemon_->waitForLine("scheduleFontFilesDeletion:", 30s)) << daemon_->output();
   (void)wrongType;
 
   // A request of the wrong shape from a program nobody signed: answered with nothing.
@@ -77,7 +77,7 @@ TEST_F(DaemonProcessTest, ScheduledFontFilesAreDeletedWhenDue) {
                         R"(["/var/mobile/Library/UserFonts/FontFiles/com.example.shop/A.otf"])"});
   ASSERT_EQ(scheduled.status, 0) << scheduled.all;
   EXPECT_EQ(scheduled.out, "[]\n");
-  ASSERT_TRUE(daemon_->waitForLine("all files deleted.", 10s)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLine("all files deleted.", 30s)) << daemon_->output();
   EXPECT_FALSE(fs::exists(font.parent_path()));
 }
 
@@ -95,7 +95,7 @@ TEST_F(DaemonProcessTest, StartsThroughSocketActivation) {
   auto result = ctl({"updating-user-fonts"});
   ASSERT_EQ(result.status, 0) << result.all << daemon_->output();
   EXPECT_EQ(result.out, "{}\n");
-  EXPECT_TRUE(daemon_->waitForLine("TyphoraHandler deallocated.", 10s)) << daemon_->output();
+  EXPECT_TRUE(daemon_->waitForLine("TyphoraHandler deallocated.", 30s)) << daemon_->output();
 }
 
 TEST_F(DaemonProcessTest, ToolsExplainThemselves) {

@@ -40,7 +40,7 @@ class EventSocketTest : public DaemonTestBase {
 TEST_F(EventSocketTest, WatchersSeeEveryPostedNotification) {
   startDaemonAndEvents();
   ChildProcess watcher({kCtl, "--runtime-dir", runtime_, "event", "watch", "--count", "2"});
-  ASSERT_TRUE(watcher.waitForLine("watching", 10s)) << watcher.output();
+  ASSERT_TRUE(watcher.waitForLine("watching", 30s)) << watcher.output();
 
   auto system = ctl({"event", "post", "--system", "com.example.ping"});
   ASSERT_EQ(system.status, 0) << system.all;
@@ -85,7 +85,7 @@ TEST_F(EventSocketTest, OnlyRootAndTheDaemonsUserMayConnect) {
                            kCtl, "--runtime-dir", runtime_, "event", "post", "--system", "x"},
                           20s);
   EXPECT_NE(other.status, 0) << other.all;
-  ASSERT_TRUE(daemon_->waitForLine("event socket: refused", 10s)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLine("event socket: refused", 30s)) << daemon_->output();
   EXPECT_EQ(ctl({"event", "post", "--system", "x"}).status, 0);
 }
 
@@ -97,7 +97,7 @@ TEST_F(EventSocketTest, TheCatalogActivityDownloadsAndTheAssetServiceAnnouncesIt
       << R"("})";
   startDaemonAndEvents();
   ChildProcess watcher({kCtl, "--runtime-dir", runtime_, "event", "watch", "--count", "1"});
-  ASSERT_TRUE(watcher.waitForLine("watching", 10s)) << watcher.output();
+  ASSERT_TRUE(watcher.waitForLine("watching", 30s)) << watcher.output();
 
   auto run = ctl({"activity", "run", "com.zorvane.typhorad.check-asset-update"});
   ASSERT_EQ(run.status, 0) << run.all << daemon_->output();
@@ -119,7 +119,7 @@ TEST_F(EventSocketTest, ARemovedApplicationTakesItsFontsWithIt) {
       ctl({"event", "post", "--distributed", "com.zorvane.Apploom.applicationUnregistered",
            R"({"bundleIDs": ["com.example.shop"]})"});
   ASSERT_EQ(posted.status, 0) << posted.all;
-  ASSERT_TRUE(daemon_->waitForLine("synchroning FontProviders", 10s)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLine("synchroning FontProviders", 30s)) << daemon_->output();
   EXPECT_FALSE(fs::exists(font.parent_path()));
   auto info =
       ctl({"plist", "show", (root_ / "var/mobile/Library/UserFonts/UserFonts.plist").string()});
@@ -143,7 +143,7 @@ TEST_F(EventSocketTest, AnEventStartsTheDaemonThroughSocketActivation) {
   // The post starts the daemon, which answers it on the inherited socket.
   auto posted = ctl({"event", "post", "--system", "com.example.ping"});
   ASSERT_EQ(posted.status, 0) << posted.all << daemon_->output();
-  EXPECT_TRUE(daemon_->waitForLine("notification posted: com.example.ping", 10s))
+  EXPECT_TRUE(daemon_->waitForLine("notification posted: com.example.ping", 30s))
       << daemon_->output();
   EXPECT_EQ(ctl({"updating-user-fonts"}).status, 0) << daemon_->output();
 }

@@ -145,7 +145,7 @@ TEST_F(FontRequestsProcessTest, ASecondRequestWaitsForTheFirstsDialogAndOneSecon
   for (int i = 0; i < 1000 && !fs::exists(started); ++i) std::this_thread::sleep_for(10ms);
   ASSERT_TRUE(fs::exists(started)) << daemon_->output();
   ChildProcess secondRequest(foregroundRequest(second, {"--family", "A"}));
-  ASSERT_TRUE(daemon_->waitForLine(kBlockedSecond, 10s)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLine(kBlockedSecond, 30s)) << daemon_->output();
   std::this_thread::sleep_for(300ms);
   EXPECT_EQ(secondRequest.waitFor(0ms), -1) << "answered while the dialog was open";
   std::ofstream(go.string()) << "";

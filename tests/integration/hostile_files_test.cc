@@ -63,12 +63,12 @@ TEST_F(HostileFilesTest, ScheduledDeletionNeverLeavesTheFontDirectories) {
                R"(outside/victim.txt", ")" + kFontFiles + R"(com.evil/victim.txt", ")" + shop +
                R"(to-file", ")" + shop + R"(A.otf"])");
   ASSERT_EQ(escapes.status, 0) << escapes.all;
-  ASSERT_TRUE(daemon_->waitForLine("all files deleted.", 10s)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLine("all files deleted.", 30s)) << daemon_->output();
   // The font-files directory itself, and what is above it.
   auto directories = schedule(R"([")" + std::string(kFontFiles) + R"(", ")" + kFontFiles +
                               R"(..", "/var/mobile/Library/UserFonts/FontAssets/.."])");
   ASSERT_EQ(directories.status, 0) << directories.all;
-  EXPECT_TRUE(daemon_->waitForLine("no files to delete.", 10s)) << daemon_->output();
+  EXPECT_TRUE(daemon_->waitForLine("no files to delete.", 30s)) << daemon_->output();
 
   // Paths are refused by their text, one line per call; the links are never followed.
   EXPECT_EQ(daemon_->countLines("scheduleFontFilesDeletion: refused 4 paths"), 1u)
@@ -89,7 +89,7 @@ TEST_F(HostileFilesTest, ThePendingTableIsBounded) {
   startDaemon();  // the default delay: nothing comes due during the test
   const std::string tooLong = std::string(kFontFiles) + "com.shop/" + std::string(1100, 'x');
   EXPECT_EQ(schedule(R"([")" + tooLong + R"("])").status, 0);
-  ASSERT_TRUE(daemon_->waitForLine("path too long", 10s)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLine("path too long", 30s)) << daemon_->output();
 
   for (int call = 0; call < 9; ++call) {
     std::string paths = "[";
@@ -99,7 +99,7 @@ TEST_F(HostileFilesTest, ThePendingTableIsBounded) {
     }
     ASSERT_EQ(schedule(paths + "]").status, 0);
   }
-  ASSERT_TRUE(daemon_->waitForLine("too many pending deletions", 10s)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLine("too many pending deletions", 30s)) << daemon_->output();
   EXPECT_EQ(daemon_->countLines("refused 404 paths"), 1u) << daemon_->output();
   const auto table = ctl({"plist", "show",
                           (root_ / "var/mobile/Library/Preferences/"
@@ -123,13 +123,13 @@ TEST_F(HostileFilesTest, ARemovedApplicationTakesItsLinkNotItsTarget) {
   fs::create_directories(onDisk(kFontFiles));
   fs::create_directory_symlink(victims_, onDisk(std::string(kFontFiles) + "com.evil"));
   startDaemon();
-  ASSERT_TRUE(daemon_->waitForLine("typhorad ready", 10s)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLine("typhorad ready", 30s)) << daemon_->output();
 
   auto posted =
       ctl({"event", "post", "--distributed", "com.zorvane.Apploom.applicationUnregistered",
            R"({"bundleIDs": ["com.evil"]})"});
   ASSERT_EQ(posted.status, 0) << posted.all;
-  ASSERT_TRUE(daemon_->waitForLine("synchroning FontProviders", 10s)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLine("synchroning FontProviders", 30s)) << daemon_->output();
   EXPECT_TRUE(victimsSurvive());
   EXPECT_FALSE(fs::is_symlink(onDisk(std::string(kFontFiles) + "com.evil")));
 }
@@ -141,11 +141,11 @@ TEST_F(HostileFilesTest, FifosInPlaceOfFilesFreezeNothing) {
   ASSERT_EQ(mkfifo((root_ / "etc/typhora/apps/fifo.plist").c_str(), 0644), 0);
   startDaemon();
   // Start-up reads the user-fonts file; a check-in reads the manifests.
-  ASSERT_TRUE(daemon_->waitForLine("typhorad ready", 10s)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLine("typhorad ready", 30s)) << daemon_->output();
   auto checkin = ctl({"call", "checkin:"});
   EXPECT_EQ(checkin.status, 0) << checkin.all << daemon_->output();
   EXPECT_EQ(checkin.out, "[null]\n");
-  EXPECT_TRUE(daemon_->waitForLine("not a regular file", 5s)) << daemon_->output();
+  EXPECT_TRUE(daemon_->waitForLine("not a regular file", 30s)) << daemon_->output();
 }
 
 TEST_F(HostileFilesTest, AnUnusableRuntimeDirectoryEndsStartUpWithAMessage) {
@@ -160,7 +160,7 @@ TEST_F(HostileFilesTest, ForgedNewlinesStayInsideOneLogLine) {
   startDaemon();
   auto forged = ctl({"call", "--unchecked", "eraseAllFonts:\nerror forged line\r\x1b[2K"});
   EXPECT_NE(forged.status, 0);
-  ASSERT_TRUE(daemon_->waitForLine("forged line", 10s)) << daemon_->output();
+  ASSERT_TRUE(daemon_->waitForLine("forged line", 30s)) << daemon_->output();
   std::this_thread::sleep_for(100ms);
   EXPECT_EQ(daemon_->countLines("forged line"), 1u);
   EXPECT_THAT(daemon_->output(), HasSubstr("eraseAllFonts:\\nerror forged line\\r\\x1b[2K"));

@@ -24,6 +24,12 @@ constexpr const char* kInvalidated =
 
 class WebContentSupportTest : public ::testing::Test {
  protected:
+  // Each connection's invalidation handler owns the handler, as the real layer holds it until the
+  // web-content process ends: end the ones still listed so the handler can go.
+  void TearDown() override {
+    for (auto& connection : handler_->webcontentProcessConnections()) connection->invalidate();
+  }
+
   void checkin() {
     handler_->checkinForBrisvelProcess(endpoint_, [this](std::vector<Value>) { ++replies_; });
   }
