@@ -14,8 +14,8 @@
 
 #include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
-#include "platform/cbor_codec.h"
-#include "platform/linux/lumo_service.h"
+#include "platform/linux/lumo/lumo_service.h"
+#include "platform/value/cbor_codec.h"
 
 namespace typhora {
 namespace {

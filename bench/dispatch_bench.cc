@@ -6,10 +6,10 @@
 #include <chrono>
 #include <vector>
 
-#include "platform/clock.h"
-#include "platform/one_shot_timer.h"
-#include "platform/semaphore.h"
-#include "platform/serial_queue.h"
+#include "platform/dispatch/clock.h"
+#include "platform/dispatch/one_shot_timer.h"
+#include "platform/dispatch/semaphore.h"
+#include "platform/dispatch/serial_queue.h"
 
 namespace typhora {
 namespace {

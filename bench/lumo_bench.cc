@@ -10,9 +10,9 @@
 #include <fstream>
 #include <thread>
 
-#include "platform/linux/lumo_frame.h"
-#include "platform/linux/lumo_admission.h"
-#include "platform/linux/lumo_service.h"
+#include "platform/linux/lumo/lumo_admission.h"
+#include "platform/linux/lumo/lumo_service.h"
+#include "platform/linux/lumo/transport/lumo_frame.h"
 
 namespace typhora {
 namespace {
@@ -25,7 +25,8 @@ std::shared_ptr<const IpcInterface> benchInterface() {
   return description;
 }
 
-class Server final : public IpcListenerDelegate, public IpcExportedObject,
+class Server final : public IpcListenerDelegate,
+                     public IpcExportedObject,
                      public std::enable_shared_from_this<Server> {
  public:
   bool shouldAcceptNewConnection(IpcListener&, std::shared_ptr<IpcConnection> c) override {
@@ -121,8 +122,8 @@ void BM_EmptyCallRoundTrip(benchmark::State& state) {
   // The raw ping-pong of the same size, in the same run; the ratio is lumo's time over it.
   const double raw = rawRoundTrip(emptyCallFrameSize(), 20'000);
   state.counters["raw_us"] = raw * 1e6;
-  state.counters["calls/s"] = benchmark::Counter(static_cast<double>(state.iterations()),
-                                                 benchmark::Counter::kIsRate);
+  state.counters["calls/s"] =
+      benchmark::Counter(static_cast<double>(state.iterations()), benchmark::Counter::kIsRate);
   connection->invalidate();
 }
 BENCHMARK(BM_EmptyCallRoundTrip)->Unit(benchmark::kMicrosecond)->UseRealTime();
@@ -131,8 +132,8 @@ void BM_ConcurrentClients(benchmark::State& state) {
   auto connection = fixture().connect();
   auto proxy = connection->synchronousRemoteObjectProxy([](const std::string&) {});
   for (auto _ : state) call(proxy, "ping:");
-  state.counters["calls/s"] = benchmark::Counter(static_cast<double>(state.iterations()),
-                                                 benchmark::Counter::kIsRate);
+  state.counters["calls/s"] =
+      benchmark::Counter(static_cast<double>(state.iterations()), benchmark::Counter::kIsRate);
   connection->invalidate();
 }
 BENCHMARK(BM_ConcurrentClients)->Threads(1)->Threads(4)->Threads(16)->UseRealTime();
@@ -167,7 +168,9 @@ void BM_ThousandIdleConnections(benchmark::State& state) {
     // One user's thousand connections: past what a service lets one user hold.
     LumoAdmission::shared().setLimits({2000, 64, 128u << 20, 64});
     std::vector<std::shared_ptr<IpcConnection>> connections;
-    auto proxyOf = [](auto& c) { return c->synchronousRemoteObjectProxy([](const std::string&) {}); };
+    auto proxyOf = [](auto& c) {
+      return c->synchronousRemoteObjectProxy([](const std::string&) {});
+    };
     for (int i = 0; i < 1000; ++i) {
       connections.push_back(fixture().connect());
       call(proxyOf(connections.back()), "ping:");  // the server side is admitted and has served

@@ -1,8 +1,8 @@
 // Encoding and decoding a user-fonts dictionary of 10,000 records in CBOR and JSON.
 #include <benchmark/benchmark.h>
 
-#include "platform/cbor_codec.h"
-#include "platform/json_codec.h"
+#include "platform/value/cbor_codec.h"
+#include "platform/value/json_codec.h"
 
 namespace typhora {
 namespace {

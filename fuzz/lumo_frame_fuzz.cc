@@ -2,7 +2,7 @@
 // pieces.
 #include <cstdint>
 
-#include "platform/linux/lumo_frame.h"
+#include "platform/linux/lumo/transport/lumo_frame.h"
 
 extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size) {
   const typhora::LumoLimits limits = typhora::LumoLimits::inboundFromClients();

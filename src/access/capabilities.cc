@@ -4,7 +4,7 @@
 
 #include "access/user_fonts_entitlement.h"
 #include "daemon/typhora_daemon.h"
-#include "platform/log.h"
+#include "platform/log/log.h"
 
 namespace typhora {
 

@@ -2,8 +2,8 @@
 // open it: directory-wide for enumeration and providers, one per file for issued fonts.
 #include "daemon/paths.h"
 #include "daemon/typhora_daemon.h"
-#include "platform/log.h"
-#include "platform/utf8.h"
+#include "platform/log/log.h"
+#include "platform/value/utf8.h"
 
 namespace typhora {
 

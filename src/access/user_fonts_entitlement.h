@@ -2,7 +2,7 @@
 // may name enumeration, use by the application, and installation. Any other value names none.
 #pragma once
 
-#include "platform/code_signing_record.h"
+#include "platform/services/code_signing_record.h"
 
 namespace typhora {
 

@@ -3,7 +3,7 @@
 #include <string>
 
 #include "daemon/typhora_daemon.h"
-#include "platform/log.h"
+#include "platform/log/log.h"
 
 namespace typhora {
 namespace {

@@ -12,11 +12,11 @@
 #include <string>
 
 #include "daemon/typhora_daemon.h"
-#include "platform/linux/device_root.h"
+#include "platform/linux/files/device_root.h"
 #include "platform/linux/heap_reserve.h"
 #include "platform/linux/linux_platform.h"
-#include "platform/linux/lumo_connection.h"
-#include "platform/log.h"
+#include "platform/linux/lumo/lumo_connection.h"
+#include "platform/log/log.h"
 
 namespace {
 

@@ -1,8 +1,8 @@
 // Applications removed from the device take their fonts with them: the registry unregisters
 // what they installed, one application at a time, and the ledger forgets what they were issued.
 #include "daemon/typhora_daemon.h"
-#include "platform/log.h"
-#include "platform/semaphore.h"
+#include "platform/dispatch/semaphore.h"
+#include "platform/log/log.h"
 
 namespace typhora {
 

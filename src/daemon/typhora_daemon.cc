@@ -2,8 +2,8 @@
 
 #include <cstdlib>
 
-#include "platform/log.h"
-#include "platform/plist_number.h"
+#include "platform/log/log.h"
+#include "platform/value/plist_number.h"
 
 namespace typhora {
 namespace {

@@ -11,11 +11,11 @@
 #include <vector>
 
 #include "ipc/local_notification_center.h"
-#include "platform/ipc_listener.h"
-#include "platform/one_shot_timer.h"
+#include "platform/dispatch/one_shot_timer.h"
+#include "platform/dispatch/serial_queue.h"
+#include "platform/ipc/ipc_listener.h"
 #include "platform/platform.h"
-#include "platform/serial_queue.h"
-#include "platform/value.h"
+#include "platform/value/value.h"
 #include "requests/request_fonts_gate.h"
 
 namespace typhora {

@@ -7,8 +7,8 @@
 #include "ipc/font_url.h"
 #include "ipc/interface_descriptions.h"
 #include "ipc/typhora_handler.h"
-#include "platform/log.h"
-#include "platform/plist_number.h"
+#include "platform/log/log.h"
+#include "platform/value/plist_number.h"
 
 namespace typhora {
 

@@ -4,7 +4,7 @@
 
 #include <memory>
 
-#include "platform/ipc_interface.h"
+#include "platform/ipc/ipc_interface.h"
 
 namespace typhora {
 

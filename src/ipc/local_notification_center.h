@@ -9,7 +9,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/value.h"
+#include "platform/value/value.h"
 
 namespace typhora {
 

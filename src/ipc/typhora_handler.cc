@@ -4,7 +4,7 @@
 
 #include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
-#include "platform/log.h"
+#include "platform/log/log.h"
 
 namespace typhora {
 namespace {

@@ -8,8 +8,8 @@
 #include <string>
 #include <vector>
 
-#include "platform/ipc_connection.h"
-#include "platform/ipc_endpoint.h"
+#include "platform/ipc/ipc_connection.h"
+#include "platform/ipc/ipc_endpoint.h"
 
 namespace typhora {
 

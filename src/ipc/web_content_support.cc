@@ -5,7 +5,7 @@
 #include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
 #include "ipc/typhora_handler.h"
-#include "platform/log.h"
+#include "platform/log/log.h"
 
 namespace typhora {
 

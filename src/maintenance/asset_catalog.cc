@@ -1,7 +1,7 @@
 // The font-access block list, loaded from the asset catalog when the asset service announces new
 // assets or new catalog metadata, and the scheduled activity that keeps the catalog fresh.
 #include "daemon/typhora_daemon.h"
-#include "platform/log.h"
+#include "platform/log/log.h"
 
 namespace typhora {
 

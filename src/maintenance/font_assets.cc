@@ -5,7 +5,7 @@
 
 #include "daemon/paths.h"
 #include "daemon/typhora_daemon.h"
-#include "platform/log.h"
+#include "platform/log/log.h"
 
 namespace typhora {
 

@@ -7,8 +7,8 @@
 
 #include "daemon/paths.h"
 #include "daemon/typhora_daemon.h"
-#include "platform/file_system.h"
-#include "platform/log.h"
+#include "platform/log/log.h"
+#include "platform/storage/file_system.h"
 
 namespace typhora {
 

@@ -3,7 +3,7 @@
 #include "catalog/font_record.h"
 #include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
-#include "platform/log.h"
+#include "platform/log/log.h"
 
 namespace typhora {
 

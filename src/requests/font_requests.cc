@@ -7,7 +7,7 @@
 #include "access/user_fonts_entitlement.h"
 #include "catalog/font_record.h"
 #include "daemon/typhora_daemon.h"
-#include "platform/log.h"
+#include "platform/log/log.h"
 
 namespace typhora {
 

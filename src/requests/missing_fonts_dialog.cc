@@ -3,7 +3,7 @@
 #include <set>
 
 #include "daemon/typhora_daemon.h"
-#include "platform/log.h"
+#include "platform/log/log.h"
 #include "requests/missing_fonts_dialog_handler.h"
 
 namespace typhora {

@@ -10,8 +10,8 @@
 #include <memory>
 #include <mutex>
 
-#include "platform/ipc_listener.h"
-#include "platform/value.h"
+#include "platform/ipc/ipc_listener.h"
+#include "platform/value/value.h"
 
 namespace typhora {
 

@@ -8,8 +8,8 @@
 #include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
 #include "ipc/typhora_handler.h"
-#include "platform/json_codec.h"
-#include "platform/semaphore.h"
+#include "platform/dispatch/semaphore.h"
+#include "platform/value/json_codec.h"
 #include "support/fake_platform.h"
 
 namespace typhora {

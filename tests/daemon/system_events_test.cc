@@ -4,7 +4,7 @@
 #include <gtest/gtest.h>
 
 #include "daemon/typhora_daemon.h"
-#include "platform/json_codec.h"
+#include "platform/value/json_codec.h"
 #include "support/fake_platform.h"
 #include "support/log_capture.h"
 

@@ -22,7 +22,7 @@
 #include <thread>
 #include <vector>
 
-#include "platform/linux/scm_rights.h"
+#include "platform/linux/lumo/transport/scm_rights.h"
 #include "support/raw_lumo_client.h"
 
 using namespace typhora;

@@ -6,7 +6,7 @@
 #include <sstream>
 
 #include "integration/daemon_test_base.h"
-#include "platform/json_codec.h"
+#include "platform/value/json_codec.h"
 
 namespace typhora::testing {
 namespace {

@@ -5,7 +5,7 @@
 
 #include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
-#include "platform/json_codec.h"
+#include "platform/value/json_codec.h"
 #include "support/fake_platform.h"
 #include "support/log_capture.h"
 

@@ -7,7 +7,7 @@
 #include <thread>
 
 #include "daemon/typhora_daemon.h"
-#include "platform/json_codec.h"
+#include "platform/value/json_codec.h"
 #include "support/fake_platform.h"
 #include "support/log_capture.h"
 

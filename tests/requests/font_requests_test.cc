@@ -8,8 +8,8 @@
 
 #include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
-#include "platform/json_codec.h"
-#include "platform/semaphore.h"
+#include "platform/dispatch/semaphore.h"
+#include "platform/value/json_codec.h"
 #include "requests/missing_fonts_dialog_handler.h"
 #include "support/fake_platform.h"
 #include "support/log_capture.h"

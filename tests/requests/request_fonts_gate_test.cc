@@ -7,7 +7,7 @@
 
 #include <thread>
 
-#include "platform/semaphore.h"
+#include "platform/dispatch/semaphore.h"
 
 namespace typhora {
 namespace {

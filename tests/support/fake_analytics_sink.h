@@ -6,7 +6,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/analytics_sink.h"
+#include "platform/services/analytics_sink.h"
 
 namespace typhora::testing {
 

@@ -5,7 +5,7 @@
 #include <map>
 #include <mutex>
 
-#include "platform/app_registry.h"
+#include "platform/services/app_registry.h"
 
 namespace typhora::testing {
 

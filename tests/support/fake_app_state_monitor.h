@@ -4,7 +4,7 @@
 #include <map>
 #include <mutex>
 
-#include "platform/app_state_monitor.h"
+#include "platform/services/app_state_monitor.h"
 
 namespace typhora::testing {
 

@@ -6,7 +6,7 @@
 #include <mutex>
 #include <vector>
 
-#include "platform/asset_catalog.h"
+#include "platform/services/asset_catalog.h"
 
 namespace typhora::testing {
 

@@ -5,7 +5,7 @@
 #include <mutex>
 #include <vector>
 
-#include "platform/build_variant.h"
+#include "platform/services/build_variant.h"
 
 namespace typhora::testing {
 

@@ -6,7 +6,7 @@
 #include <mutex>
 #include <tuple>
 
-#include "platform/code_signing_query.h"
+#include "platform/services/code_signing_query.h"
 
 namespace typhora::testing {
 

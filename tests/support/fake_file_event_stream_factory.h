@@ -4,7 +4,7 @@
 #include <mutex>
 #include <vector>
 
-#include "platform/file_event_stream.h"
+#include "platform/storage/file_event_stream.h"
 
 namespace typhora::testing {
 

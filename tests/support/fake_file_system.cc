@@ -2,7 +2,7 @@
 
 #include <algorithm>
 
-#include "platform/plist_reader.h"
+#include "platform/value/plist_reader.h"
 
 namespace typhora::testing {
 

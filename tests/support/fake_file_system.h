@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/file_system.h"
+#include "platform/storage/file_system.h"
 
 namespace typhora::testing {
 

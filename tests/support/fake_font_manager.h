@@ -9,8 +9,8 @@
 #include <utility>
 #include <vector>
 
-#include "platform/semaphore.h"
-#include "platform/ty_user_font_manager.h"
+#include "platform/dispatch/semaphore.h"
+#include "platform/storage/ty_user_font_manager.h"
 
 namespace typhora::testing {
 

@@ -6,7 +6,7 @@
 #include <mutex>
 #include <optional>
 
-#include "platform/ipc_connection.h"
+#include "platform/ipc/ipc_connection.h"
 
 namespace typhora::testing {
 

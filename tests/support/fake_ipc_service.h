@@ -7,8 +7,8 @@
 #include <memory>
 #include <mutex>
 
-#include "platform/ipc_listener.h"
-#include "platform/semaphore.h"
+#include "platform/dispatch/semaphore.h"
+#include "platform/ipc/ipc_listener.h"
 #include "support/fake_ipc_connection.h"
 
 namespace typhora::testing {

@@ -4,7 +4,7 @@
 #include <map>
 #include <mutex>
 
-#include "platform/launch_event_stream.h"
+#include "platform/services/launch_event_stream.h"
 
 namespace typhora::testing {
 

@@ -1,7 +1,7 @@
 // One fake of every platform interface, and the Platform bundle over them.
 #pragma once
 
-#include "platform/manual_clock.h"
+#include "platform/dispatch/manual_clock.h"
 #include "platform/platform.h"
 #include "support/fake_analytics_sink.h"
 #include "support/fake_app_registry.h"

@@ -4,7 +4,7 @@
 #include <map>
 #include <mutex>
 
-#include "platform/preferences_store.h"
+#include "platform/storage/preferences_store.h"
 
 namespace typhora::testing {
 

@@ -4,7 +4,7 @@
 #include <mutex>
 #include <vector>
 
-#include "platform/remote_alert.h"
+#include "platform/services/remote_alert.h"
 
 namespace typhora::testing {
 

@@ -9,7 +9,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/sandbox_broker.h"
+#include "platform/services/sandbox_broker.h"
 
 namespace typhora::testing {
 

@@ -4,7 +4,7 @@
 #include <map>
 #include <mutex>
 
-#include "platform/scheduled_activity.h"
+#include "platform/services/scheduled_activity.h"
 
 namespace typhora::testing {
 

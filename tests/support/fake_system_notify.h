@@ -4,7 +4,7 @@
 #include <mutex>
 #include <vector>
 
-#include "platform/system_notify.h"
+#include "platform/services/system_notify.h"
 
 namespace typhora::testing {
 

@@ -7,7 +7,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/log.h"
+#include "platform/log/log.h"
 
 namespace typhora::testing {
 

@@ -12,7 +12,7 @@
 #include <string>
 #include <vector>
 
-#include "platform/linux/lumo_frame.h"
+#include "platform/linux/lumo/transport/lumo_frame.h"
 
 namespace typhora::raw {
 

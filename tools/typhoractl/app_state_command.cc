@@ -4,7 +4,7 @@
 #include <iostream>
 #include <optional>
 
-#include "platform/linux/linux_app_state_monitor.h"
+#include "platform/linux/identity/linux_app_state_monitor.h"
 
 namespace typhora::ctl {
 

@@ -4,7 +4,7 @@
 #include <memory>
 
 #include "ipc/interface_descriptions.h"
-#include "platform/json_codec.h"
+#include "platform/value/json_codec.h"
 #include "service_session.h"
 
 namespace typhora::ctl {

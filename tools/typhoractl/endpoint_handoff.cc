@@ -6,7 +6,7 @@
 #include <cstring>
 #include <vector>
 
-#include "platform/linux/scm_rights.h"
+#include "platform/linux/lumo/transport/scm_rights.h"
 
 namespace typhora::ctl {
 

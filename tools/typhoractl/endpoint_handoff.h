@@ -5,7 +5,7 @@
 #include <memory>
 #include <string>
 
-#include "platform/linux/lumo_endpoint.h"
+#include "platform/linux/lumo/lumo_endpoint.h"
 
 namespace typhora::ctl {
 

@@ -4,9 +4,9 @@
 #include <iostream>
 
 #include "notification_printer.h"
-#include "platform/json_codec.h"
-#include "platform/linux/event_socket_protocol.h"
-#include "platform/linux/lumo_service.h"
+#include "platform/linux/events/event_socket_protocol.h"
+#include "platform/linux/lumo/lumo_service.h"
+#include "platform/value/json_codec.h"
 
 namespace typhora::ctl {
 

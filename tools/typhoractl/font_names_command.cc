@@ -2,8 +2,8 @@
 
 #include <iostream>
 
-#include "platform/json_codec.h"
-#include "platform/linux/font_face_names.h"
+#include "platform/linux/fonts/font_face_names.h"
+#include "platform/value/json_codec.h"
 
 namespace typhora::ctl {
 namespace {

@@ -3,7 +3,7 @@
 #include <iostream>
 
 #include "ipc/interface_descriptions.h"
-#include "platform/json_codec.h"
+#include "platform/value/json_codec.h"
 
 namespace typhora::ctl {
 

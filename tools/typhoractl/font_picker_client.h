@@ -5,7 +5,7 @@
 #include <atomic>
 #include <memory>
 
-#include "platform/ipc_listener.h"
+#include "platform/ipc/ipc_listener.h"
 
 namespace typhora::ctl {
 

@@ -5,9 +5,9 @@
 #include "child_launcher.h"
 #include "font_picker_client.h"
 #include "ipc/interface_descriptions.h"
-#include "platform/json_codec.h"
-#include "platform/linux/lumo_endpoint.h"
-#include "platform/linux/lumo_service.h"
+#include "platform/linux/lumo/lumo_endpoint.h"
+#include "platform/linux/lumo/lumo_service.h"
+#include "platform/value/json_codec.h"
 #include "service_session.h"
 
 namespace typhora::ctl {

@@ -8,9 +8,9 @@
 
 #include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
-#include "platform/json_codec.h"
-#include "platform/linux/lumo_service.h"
-#include "platform/semaphore.h"
+#include "platform/dispatch/semaphore.h"
+#include "platform/linux/lumo/lumo_service.h"
+#include "platform/value/json_codec.h"
 
 namespace typhora::ctl {
 namespace {

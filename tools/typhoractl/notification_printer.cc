@@ -2,7 +2,7 @@
 
 #include <iostream>
 
-#include "platform/json_codec.h"
+#include "platform/value/json_codec.h"
 
 namespace typhora::ctl {
 

@@ -4,8 +4,8 @@
 
 #include <atomic>
 
-#include "platform/ipc_connection.h"
-#include "platform/semaphore.h"
+#include "platform/dispatch/semaphore.h"
+#include "platform/ipc/ipc_connection.h"
 
 namespace typhora::ctl {
 

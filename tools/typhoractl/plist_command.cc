@@ -4,9 +4,9 @@
 #include <fstream>
 #include <iostream>
 
-#include "platform/cbor_codec.h"
-#include "platform/json_codec.h"
-#include "platform/plist_reader.h"
+#include "platform/value/cbor_codec.h"
+#include "platform/value/json_codec.h"
+#include "platform/value/plist_reader.h"
 
 namespace typhora::ctl {
 namespace {

@@ -4,8 +4,8 @@
 #include <iostream>
 
 #include "daemon/typhora_daemon.h"
-#include "platform/json_codec.h"
-#include "platform/linux/lumo_connection.h"
+#include "platform/linux/lumo/lumo_connection.h"
+#include "platform/value/json_codec.h"
 
 namespace typhora::ctl {
 

@@ -7,8 +7,8 @@
 #include <vector>
 
 #include "client_command.h"
-#include "platform/ipc_connection.h"
-#include "platform/linux/lumo_service.h"
+#include "platform/ipc/ipc_connection.h"
+#include "platform/linux/lumo/lumo_service.h"
 
 namespace typhora::ctl {
 

@@ -6,9 +6,9 @@
 #include <optional>
 
 #include "ipc/interface_descriptions.h"
-#include "platform/json_codec.h"
-#include "platform/linux/lumo_connection.h"
-#include "platform/linux/lumo_endpoint.h"
+#include "platform/linux/lumo/lumo_connection.h"
+#include "platform/linux/lumo/lumo_endpoint.h"
+#include "platform/value/json_codec.h"
 
 namespace typhora::ctl {
 namespace {

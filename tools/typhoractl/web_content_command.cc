@@ -9,9 +9,9 @@
 #include "child_launcher.h"
 #include "endpoint_handoff.h"
 #include "ipc/interface_descriptions.h"
-#include "platform/json_codec.h"
-#include "platform/linux/lumo_service.h"
-#include "platform/linux/unique_fd.h"
+#include "platform/fd/unique_fd.h"
+#include "platform/linux/lumo/lumo_service.h"
+#include "platform/value/json_codec.h"
 #include "service_session.h"
 #include "web_content_server.h"
 

@@ -5,8 +5,8 @@
 #include <memory>
 #include <mutex>
 
-#include "platform/ipc_listener.h"
-#include "platform/semaphore.h"
+#include "platform/dispatch/semaphore.h"
+#include "platform/ipc/ipc_listener.h"
 
 namespace typhora::ctl {
 

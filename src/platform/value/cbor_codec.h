@@ -1,0 +1,30 @@
+// CBOR (RFC 8949) encoding of Values: the wire and file format.
+// Dates are tag 1 with a double; data are byte strings; endpoints use kCborEndpointTag.
+#pragma once
+
+#include <optional>
+#include <span>
+#include <string>
+
+#include "platform/value/value.h"
+#include "platform/value/value_codec.h"
+
+namespace typhora {
+
+class CborCodec {
+ public:
+  // Appends the encoding of `value` to `out`. Fails (false, with `error` set when given) only for
+  // an endpoint that the hooks cannot place, or for nesting deeper than `maxDepth`.
+  static bool encode(const Value& value, Bytes* out, const EndpointHooks* hooks = nullptr,
+                     std::string* error = nullptr, std::size_t maxDepth = 64);
+  static Bytes encode(const Value& value);  // no endpoints; never fails for other values
+
+  // Decodes exactly one item filling all of `input`. nullopt on failure, with `error` telling
+  // what was wrong and where. A CBOR null decodes to a null Value (not a failure).
+  static std::optional<Value> decode(std::span<const std::uint8_t> input,
+                                     const DecodeLimits& limits = {},
+                                     const EndpointHooks* hooks = nullptr,
+                                     std::string* error = nullptr);
+};
+
+}  // namespace typhora

@@ -1,0 +1,160 @@
+// A peer process for the lumo tests. Modes:
+//   call DIR OP JSON       calls OP of service "test.a" with one argument, prints the reply
+//   hang DIR               calls "hang:reply:" (never answered) and waits
+//   serve-c DIR            serves "test.c": useEndpoint:reply: connects to the endpoint given
+//                          and answers with what its echo:reply: says
+//   forward DIR            asks "test.a" for an endpoint and hands it to "test.c"
+//   exec-after-call DIR    calls echo:reply:, then becomes /bin/sleep
+//   flood DIR              sends large calls on a raw socket and never reads the answers
+//   garbage DIR            sends bytes that are no frame, then a valid call
+//   notes DIR N            N times: connects, sends the one-way note: and closes at once
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <iostream>
+#include <thread>
+
+#include "platform/dispatch/semaphore.h"
+#include "platform/linux/lumo/lumo_connection.h"
+#include "platform/linux/lumo/lumo_service.h"
+#include "platform/linux/lumo/transport/lumo_frame.h"
+#include "platform/value/json_codec.h"
+#include "support/lumo_test_interface.h"
+#include "support/raw_lumo_client.h"
+
+using namespace typhora;
+
+namespace {
+
+std::vector<Value> callA(LumoService& service, const std::string& op, std::vector<Value> args,
+                         bool* ok) {
+  auto connection = service.connectToService("test.a");
+  connection->setRemoteInterface(lumoTestInterface());
+  connection->resume();
+  std::vector<Value> reply;
+  *ok = false;
+  connection->synchronousRemoteObjectProxy([](const std::string& e) { std::cerr << e << "\n"; })
+      ->call(op, std::move(args), [&](std::vector<Value> r) {
+        reply = std::move(r);
+        *ok = true;
+      });
+  connection->invalidate();
+  return reply;
+}
+
+int rawConnect(const std::string& dir) {
+  int fd = raw::connectTo(dir + "/test.a");
+  return fd >= 0 && raw::handshake(fd) ? fd : -1;
+}
+
+class UseEndpoint final : public IpcExportedObject {
+ public:
+  explicit UseEndpoint(LumoService& service) : service_(service) {}
+  bool invoke(const IpcOperation&, const std::vector<Value>& args, IpcReply reply) override {
+    auto connection = service_.connect(*args[0].asEndpoint());
+    connection->setRemoteInterface(lumoTestInterface());
+    connection->resume();
+    Value answer;
+    connection->synchronousRemoteObjectProxy([](const std::string&) {})
+        ->call("echo:reply:", {Value("from c")}, [&](std::vector<Value> r) { answer = r.at(0); });
+    connection->invalidate();
+    reply({answer});
+    return true;
+  }
+
+ private:
+  LumoService& service_;
+};
+
+class Delegate final : public IpcListenerDelegate {
+ public:
+  explicit Delegate(LumoService& service) : service_(service) {}
+  bool shouldAcceptNewConnection(IpcListener&, std::shared_ptr<IpcConnection> c) override {
+    c->setExportedInterface(lumoTestInterface());
+    c->setExportedObject(std::make_shared<UseEndpoint>(service_));
+    c->resume();
+    return true;
+  }
+
+ private:
+  LumoService& service_;
+};
+
+}  // namespace
+
+int main(int argc, char** argv) {
+  if (argc < 3) return 2;
+  const std::string mode = argv[1];
+  const std::string dir = argv[2];
+  LumoService service(dir);
+  bool ok = false;
+  if (mode == "call" && argc == 5) {
+    auto reply = callA(service, argv[3], {*JsonCodec::decode(argv[4])}, &ok);
+    std::cout << JsonCodec::encode(Value(ValueArray(reply))) << std::endl;
+    return ok ? 0 : 1;
+  }
+  if (mode == "notes" && argc == 4) {
+    for (int i = std::stoi(argv[3]); i > 0; --i) {
+      auto connection = LumoConnection::toPath(dir + "/test.a");
+      connection->setRemoteInterface(lumoTestInterface());
+      connection->resume();
+      connection->remoteObjectProxy({})->call("note:", {Value("n")});
+      if (!connection->waitUntilSent(std::chrono::seconds(10))) return 1;
+      connection->invalidate();
+    }
+    return 0;
+  }
+  if (mode == "hang") {
+    std::cout << "calling" << std::endl;
+    callA(service, "hang:reply:", {}, &ok);
+    return 0;
+  }
+  if (mode == "serve-c") {
+    auto delegate = std::make_shared<Delegate>(service);
+    auto listener = service.makeNamedListener("test.c");
+    listener->setDelegate(delegate);
+    listener->resume();
+    std::cout << "ready" << std::endl;
+    Semaphore forever;
+    forever.wait();
+  }
+  if (mode == "forward") {
+    auto endpoint = callA(service, "endpoint:reply:", {}, &ok);
+    if (!ok) return 1;
+    auto c = service.connectToService("test.c");
+    c->setRemoteInterface(lumoTestInterface());
+    c->resume();
+    Value answer;
+    c->synchronousRemoteObjectProxy([](const std::string& e) {
+       std::cerr << e << "\n";
+     })->call("useEndpoint:reply:", {endpoint.at(0)}, [&](std::vector<Value> r) {
+      answer = r.at(0);
+    });
+    std::cout << answer.description() << std::endl;
+    return answer.isNull() ? 1 : 0;
+  }
+  if (mode == "exec-after-call") {
+    callA(service, "echo:reply:", {Value("before exec")}, &ok);
+    execl("/bin/sleep", "sleep", "30", static_cast<char*>(nullptr));
+    return 1;
+  }
+  if (mode == "flood") {
+    int fd = rawConnect(dir);
+    auto frame = raw::frameOf("echo:reply:", {Value(std::string(1 << 20, 'f'))}, 1);
+    for (int i = 0; i < 200; ++i) {
+      if (send(fd, frame.data(), frame.size(), MSG_NOSIGNAL) < 0) break;
+    }
+    std::cout << "flooded" << std::endl;
+    pause();
+  }
+  if (mode == "garbage") {
+    int fd = rawConnect(dir);
+    const char junk[] = "GET / HTTP/1.1\r\n\r\n";
+    send(fd, junk, sizeof junk, MSG_NOSIGNAL);
+    char byte;
+    return recv(fd, &byte, 1, 0) == 0 ? 0 : 1;  // the listener side closes on us
+  }
+  return 2;
+}

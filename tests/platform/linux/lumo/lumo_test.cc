@@ -1,0 +1,227 @@
+// lumo between real processes: this test process serves "test.a"; peers are lumo_peer.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/resource.h>
+#include <sys/wait.h>
+
+#include <atomic>
+#include <filesystem>
+#include <thread>
+
+#include "integration/child_process.h"
+#include "platform/dispatch/semaphore.h"
+#include "platform/linux/identity/process_identity.h"
+#include "platform/linux/lumo/lumo_admission.h"
+#include "platform/linux/lumo/lumo_service.h"
+#include "support/log_capture.h"
+#include "support/lumo_test_interface.h"
+
+namespace typhora {
+namespace {
+
+using namespace std::chrono_literals;
+using ::testing::HasSubstr;
+using typhora::testing::ChildProcess;
+using typhora::testing::runCommand;
+namespace fs = std::filesystem;
+
+// Serves the test interface; remembers who called and whose connections went away.
+class Server final : public IpcListenerDelegate, public std::enable_shared_from_this<Server> {
+ public:
+  explicit Server(LumoService& service) : service_(service) {}
+
+  class Object final : public IpcExportedObject {
+   public:
+    explicit Object(std::shared_ptr<Server> server) : server_(*server), keep_(std::move(server)) {}
+    bool invoke(const IpcOperation& op, const std::vector<Value>& args, IpcReply reply) override {
+      server_.lastCaller = IpcConnection::current()->auditToken();
+      if (op.wireName == "echo:reply:") reply({args[0]});
+      if (op.wireName == "count:reply:") reply({Value(*args[0].asInt() + 1)});
+      if (op.wireName == "hang:reply:") server_.hung.signal();  // never answered
+      if (op.wireName == "note:") server_.noted.signal();
+      if (op.wireName == "endpoint:reply:") reply({Value(server_.anonymous->endpoint())});
+      return op.wireName != "useEndpoint:reply:";
+    }
+
+   private:
+    Server& server_;
+    std::shared_ptr<Server> keep_;  // handlers may outlive the test that made the server
+  };
+
+  bool shouldAcceptNewConnection(IpcListener&, std::shared_ptr<IpcConnection> c) override {
+    c->setExportedInterface(lumoTestInterface());
+    c->setExportedObject(std::make_shared<Object>(shared_from_this()));
+    c->setInvalidationHandler([self = shared_from_this()] {
+      ++self->invalidations;
+      self->invalidated.signal();
+    });
+    c->resume();
+    ++accepted;
+    return true;
+  }
+
+  LumoService& service_;
+  std::shared_ptr<IpcListener> anonymous;
+  std::atomic<int> accepted{0};
+  std::atomic<int> invalidations{0};
+  Semaphore invalidated;
+  Semaphore hung;
+  Semaphore noted;
+  AuditToken lastCaller;
+};
+
+class LumoTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    char pattern[] = "/tmp/typhora-lumo-XXXXXX";
+    dir_ = mkdtemp(pattern);
+    service_ = std::make_unique<LumoService>(dir_);
+    server_ = std::make_shared<Server>(*service_);
+    listener_ = service_->makeNamedListener("test.a");
+    ASSERT_NE(listener_, nullptr);
+    listener_->setDelegate(server_);
+    listener_->resume();
+    server_->anonymous = service_->makeAnonymousListener();
+    server_->anonymous->setDelegate(server_);
+    server_->anonymous->resume();
+  }
+  void TearDown() override {
+    listener_->invalidate();
+    server_->anonymous->invalidate();
+    fs::remove_all(dir_);
+  }
+  std::vector<std::string> peer(std::vector<std::string> args) {
+    std::vector<std::string> argv = {LUMO_PEER_PATH, args[0], dir_};
+    argv.insert(argv.end(), args.begin() + 1, args.end());
+    return argv;
+  }
+  void waitForInvalidations(int n) {
+    for (int i = 0; i < 500 && server_->invalidations < n; ++i) std::this_thread::sleep_for(10ms);
+  }
+
+  std::string dir_;
+  std::unique_ptr<LumoService> service_;
+  std::shared_ptr<Server> server_;
+  std::shared_ptr<IpcListener> listener_;
+};
+
+TEST_F(LumoTest, ACallFromAnotherProcessIsAnsweredAndItsCallerIdentified) {
+  ChildProcess child(peer({"call", "echo:reply:", R"({"a": [1, {"$data": "AAE="}]})"}));
+  EXPECT_EQ(child.wait(), 0);
+  child.finishOutput();
+  EXPECT_EQ(child.standardOutput(), "[{\"a\":[1,{\"$data\":\"AAE=\"}]}]\n");
+  EXPECT_EQ(server_->lastCaller.pid, child.pid());
+  EXPECT_EQ(server_->lastCaller.uid, getuid());
+}
+
+TEST_F(LumoTest, AnEndpointTravelsFromAThroughBToCWhichThenConnectsToA) {
+  ChildProcess c(peer({"serve-c"}));
+  ASSERT_TRUE(c.waitForLine("ready", 10s));
+  auto b = runCommand(peer({"forward"}), 20s);
+  EXPECT_EQ(b.status, 0) << b.all;
+  EXPECT_EQ(b.out, "from c\n");
+  // The last call A served came from C, over the anonymous listener.
+  EXPECT_EQ(server_->lastCaller.pid, c.pid());
+}
+
+TEST_F(LumoTest, BadMessagesAreRefusedAndEveryoneElseIsStillServed) {
+  testing::LogCapture log;
+  auto unknown = runCommand(peer({"call", "noSuchThing:", "1"}), 20s);
+  EXPECT_NE(unknown.status, 0);  // refused on the caller's side: not in the interface
+  auto wrongType = runCommand(peer({"call", "count:reply:", "\"seven\""}), 20s);
+  EXPECT_NE(wrongType.status, 0);
+  auto garbage = runCommand(peer({"garbage"}), 20s);
+  EXPECT_EQ(garbage.status, 0) << "the listener side must close a connection sending junk";
+  EXPECT_TRUE(log.contains("lumo error: -[LumoConnection read] - bad frame magic"));
+  auto good = runCommand(peer({"call", "count:reply:", "41"}), 20s);
+  EXPECT_EQ(good.status, 0);
+  EXPECT_EQ(good.out, "[42]\n");
+}
+
+TEST_F(LumoTest, OneWayCallsSentJustBeforeThePeerClosesAreServed) {
+  constexpr int kNotes = 50;
+  auto peerRun = runCommand(peer({"notes", std::to_string(kNotes)}), 60s);
+  ASSERT_EQ(peerRun.status, 0) << peerRun.all;
+  for (int i = 0; i < kNotes; ++i) ASSERT_TRUE(server_->noted.waitFor(20s)) << i;
+}
+
+TEST_F(LumoTest, APeerKilledInTheMiddleOfACallRunsTheInvalidationHandlerOnce) {
+  ChildProcess child(peer({"hang"}));
+  server_->hung.wait();
+  child.kill(SIGKILL);
+  child.wait();
+  server_->invalidated.wait();
+  std::this_thread::sleep_for(50ms);
+  EXPECT_EQ(server_->invalidations.load(), 1);
+}
+
+TEST_F(LumoTest, APeerThatStopsReadingIsCutOffWhileOthersAreAnswered) {
+  testing::LogCapture log;
+  ChildProcess flood(peer({"flood"}));
+  std::vector<std::thread> clients;
+  std::atomic<int> answered{0};
+  for (int i = 0; i < 10; ++i) {
+    clients.emplace_back([&, i] {
+      auto r = runCommand(peer({"call", "count:reply:", std::to_string(i)}), 30s);
+      answered += r.status == 0 && r.out == "[" + std::to_string(i + 1) + "]\n";
+    });
+  }
+  for (auto& t : clients) t.join();
+  EXPECT_EQ(answered.load(), 10);
+  for (int i = 0; i < 1000 && !log.contains("cut off"); ++i) std::this_thread::sleep_for(10ms);
+  EXPECT_TRUE(log.contains("the peer stopped reading; cut off")) << flood.output();
+}
+
+TEST_F(LumoTest, AThousandSimultaneousConnectionsAreServed) {
+  rlimit limit{};
+  getrlimit(RLIMIT_NOFILE, &limit);
+  limit.rlim_cur = std::min<rlim_t>(limit.rlim_max, 8192);
+  setrlimit(RLIMIT_NOFILE, &limit);
+  if (limit.rlim_cur < 4096) GTEST_SKIP() << "not enough descriptors";
+  // One user opening a thousand connections at once: past the caps a service puts on one user.
+  LumoAdmission::shared().setLimits({2000, 2000, 1u << 30, 64});
+  LumoService client(dir_);
+  std::vector<std::shared_ptr<IpcConnection>> connections;
+  std::atomic<int> replies{0};
+  Semaphore done;
+  for (int i = 0; i < 1000; ++i) {
+    auto c = client.connectToService("test.a");
+    c->setRemoteInterface(lumoTestInterface());
+    c->resume();
+    connections.push_back(c);
+  }
+  for (int i = 0; i < 1000; ++i) {
+    connections[static_cast<std::size_t>(i)]
+        ->remoteObjectProxy([&](const std::string&) { done.signal(); })
+        ->call("count:reply:", {Value(i)}, [&, i](std::vector<Value> r) {
+          replies += r.at(0) == Value(i + 1);
+          done.signal();
+        });
+  }
+  for (int i = 0; i < 1000; ++i) ASSERT_TRUE(done.waitFor(30s));
+  EXPECT_EQ(replies.load(), 1000);
+  for (auto& c : connections) c->invalidate();
+  LumoAdmission::shared().setLimits({});
+}
+
+TEST_F(LumoTest, ATokenStopsValidatingOnceItsProcessExecsAnotherProgram) {
+  ChildProcess child(peer({"exec-after-call"}));
+  for (int i = 0; i < 500 && server_->lastCaller.pid != child.pid(); ++i) {
+    std::this_thread::sleep_for(10ms);
+  }
+  AuditToken token = server_->lastCaller;
+  ASSERT_EQ(token.pid, child.pid());
+  for (int i = 0; i < 500 && ProcessIdentity::isValid(token); ++i)
+    std::this_thread::sleep_for(10ms);
+  EXPECT_FALSE(ProcessIdentity::isValid(token));
+  EXPECT_FALSE(ProcessIdentity::executablePath(token));
+  // The test process's own token stays valid; the zero token never is.
+  AuditToken self = ProcessIdentity::ofProcess(getpid(), getuid(), getgid());
+  EXPECT_TRUE(ProcessIdentity::isValid(self));
+  EXPECT_FALSE(ProcessIdentity::isValid(AuditToken{}));
+  child.kill(SIGKILL);
+}
+
+}  // namespace
+}  // namespace typhora
