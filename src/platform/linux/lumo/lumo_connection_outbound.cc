@@ -1,0 +1,183 @@
+// Writing a lumo connection: frames queued with a byte bound and written without blocking,
+// calls correlated with their answers by id, and the proxies that make them.
+#include <fcntl.h>
+#include <sys/epoll.h>
+#include <sys/socket.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "platform/linux/lumo/lumo_connection.h"
+#include "platform/linux/lumo/lumo_connection_parts.h"
+#include "platform/linux/lumo/lumo_endpoint.h"
+#include "platform/linux/lumo/lumo_proxy.h"
+#include "platform/linux/lumo/transport/lumo_event_loop.h"
+#include "platform/linux/lumo/transport/scm_rights.h"
+#include "platform/log/log.h"
+
+namespace typhora {
+
+using lumo_detail::kLumoError;
+
+bool LumoConnection::send(const LumoMessage& message, std::string* error) {
+  auto out = std::make_unique<Outgoing>();
+  std::vector<int> fds;
+  auto fdOf = [](const std::shared_ptr<const IpcEndpoint>& endpoint) {
+    auto* lumo = dynamic_cast<const LumoEndpoint*>(endpoint.get());
+    return lumo != nullptr ? fcntl(lumo->fd(), F_DUPFD_CLOEXEC, 0) : -1;
+  };
+  const bool encoded = encodeLumoFrame(message, &out->bytes, &fds, fdOf, error);
+  for (int fd : fds) out->fds.emplace_back(fd);
+  if (!encoded) return false;
+  bool cutOff = false;
+  {
+    std::lock_guard lock(mutex_);
+    if (!valid_ || !fd_.valid()) return *error = "the connection is not open", false;
+    cutOff = !enqueueLocked(std::move(out), false, error);
+  }
+  if (cutOff) {
+    if (error->empty()) *error = "the peer stopped reading; cut off";
+    SystemLog(kLumoError, "-[LumoConnection send]", *error);
+    end(*error, false);
+    return false;
+  }
+  return true;
+}
+
+bool LumoConnection::enqueueLocked(std::unique_ptr<Outgoing> out, bool first, std::string* error) {
+  if (outboundBytes_ + out->bytes.size() > kOutboundLimit) return false;
+  outboundBytes_ += out->bytes.size();
+  if (first && !outbound_.empty() && outbound_.front()->offset == 0) {
+    outbound_.push_front(std::move(out));
+  } else if (first) {
+    outbound_.insert(outbound_.begin() + (outbound_.empty() ? 0 : 1), std::move(out));
+  } else {
+    outbound_.push_back(std::move(out));
+  }
+  return flushLocked(error);
+}
+
+bool LumoConnection::flushLocked(std::string* error) {
+  // A connecting side says nothing before the peer's Hello has come and been answered.
+  const bool held = outgoing_ && handshake_ != Handshake::Done;
+  while (!outbound_.empty() && !held) {
+    Outgoing& front = *outbound_.front();
+    iovec iov{front.bytes.data() + front.offset, front.bytes.size() - front.offset};
+    msghdr msg{};
+    msg.msg_iov = &iov;
+    msg.msg_iovlen = 1;
+    std::vector<char> control;
+    if (front.offset == 0) {
+      std::vector<int> fds;
+      for (const UniqueFd& fd : front.fds) fds.push_back(fd.get());
+      attachDescriptors(&msg, &control, fds);
+    }
+    ssize_t n = sendmsg(fd_.get(), &msg, MSG_NOSIGNAL | MSG_DONTWAIT);
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) break;
+    if (n < 0) {
+      *error = std::strerror(errno);
+      return false;
+    }
+    front.fds.clear();  // the descriptors went with the first byte
+    front.offset += static_cast<std::size_t>(n);
+    if (front.offset == front.bytes.size()) {
+      outboundBytes_ -= front.bytes.size();
+      outbound_.pop_front();
+    }
+  }
+  const bool wantWrites = !outbound_.empty() && !held;
+  if (outbound_.empty()) sent_.notify_all();
+  if (wantWrites != watchingWrites_ && resumed_) {
+    watchingWrites_ = wantWrites;
+    updateInterestLocked();
+  }
+  return true;
+}
+
+bool LumoConnection::waitUntilSent(std::chrono::milliseconds timeout) {
+  std::unique_lock lock(mutex_);
+  sent_.wait_for(lock, timeout, [this] { return outbound_.empty() || !valid_; });
+  return outbound_.empty() && !droppedOutbound_;
+}
+
+void LumoConnection::call(const std::string& wireName, std::vector<Value> arguments,
+                          IpcReply onReply, IpcErrorHandler onError, bool synchronous) {
+  std::shared_ptr<const IpcInterface> remote;
+  {
+    std::lock_guard lock(mutex_);
+    remote = remoteInterface_;
+  }
+  const IpcOperation* op = remote ? remote->find(wireName) : nullptr;
+  std::string why;
+  if (op == nullptr) why = "the remote interface has no operation " + wireName;
+  if (op != nullptr && !IpcInterface::matches(*op, arguments, &why)) op = nullptr;
+  if (op == nullptr) {
+    if (onError) onError(why);
+    return;
+  }
+  auto pending = std::make_shared<Pending>();
+  pending->onReply = std::move(onReply);
+  pending->onError = onError;
+  pending->synchronous = synchronous;
+  std::uint64_t id = 0;
+  const bool waits = synchronous && op->replies;
+  if (op->replies) {
+    std::lock_guard lock(mutex_);
+    if (!valid_) {
+      why = "the connection is not open";
+    } else {
+      id = nextId_++;
+      pending_[id] = pending;
+      if (waits && ++synchronousWaiting_ == 1 && readPaused_) {
+        // The answer may sit behind the invocations that paused reading.
+        readPaused_ = false;
+        updateInterestLocked();
+      }
+    }
+  }
+  if (why.empty() &&
+      !send(LumoMessage{LumoMessage::Kind::Invoke, id, wireName, std::move(arguments)}, &why)) {
+    std::lock_guard lock(mutex_);
+    pending_.erase(id);
+  }
+  if (waits && id != 0) {
+    if (why.empty()) {
+      std::unique_lock lock(pending->mutex);
+      pending->answered.wait(lock, [&] { return pending->done; });
+    }
+    std::lock_guard lock(mutex_);
+    --synchronousWaiting_;
+  }
+  if (!why.empty()) {
+    if (onError) onError(why);
+    return;
+  }
+  if (!waits) return;
+  std::optional<LumoRawFrame> frame = std::move(pending->frame);
+  std::string error = pending->error;
+  std::optional<LumoMessage> message;
+  if (frame) {
+    message = decode(std::move(*frame), &error);
+    if (message && message->kind == LumoMessage::Kind::Error) error = message->text;
+  }
+  CurrentScope scope(shared_from_this());
+  if (message && message->kind != LumoMessage::Kind::Error) {
+    if (pending->onReply) pending->onReply(std::move(message->values));
+  } else if (pending->onError) {
+    pending->onError(error);
+  }
+}
+
+std::shared_ptr<IpcRemoteProxy> LumoConnection::remoteObjectProxy(IpcErrorHandler errorHandler) {
+  return std::make_shared<LumoProxy>(std::static_pointer_cast<LumoConnection>(shared_from_this()),
+                                     std::move(errorHandler), false);
+}
+
+std::shared_ptr<IpcRemoteProxy> LumoConnection::synchronousRemoteObjectProxy(
+    IpcErrorHandler errorHandler) {
+  return std::make_shared<LumoProxy>(std::static_pointer_cast<LumoConnection>(shared_from_this()),
+                                     std::move(errorHandler), true);
+}
+
+}  // namespace typhora
