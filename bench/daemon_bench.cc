@@ -12,6 +12,7 @@
 #include <string>
 #include <thread>
 
+#include "bench_device.h"
 #include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
 #include "platform/cbor_codec.h"
@@ -25,26 +26,6 @@ using Clock = std::chrono::steady_clock;
 
 const std::string kDaemon = std::string(TYPHORA_BINARY_DIR) + "/src/typhorad";
 
-Value userFontsOf(int records) {
-  std::vector<DictionaryEntry> entries;
-  entries.reserve(static_cast<std::size_t>(records));
-  for (int i = 0; i < records; ++i) {
-    std::vector<DictionaryEntry> names;
-    const std::string family = "Family " + std::to_string(i);
-    for (int k = 0; k < 1 + i % 4; ++k) {
-      names.emplace_back("Family" + std::to_string(i) + "-Style" + std::to_string(k), family);
-    }
-    entries.emplace_back("/var/mobile/Library/UserFonts/FontFiles/com.example.provider" +
-                             std::to_string(i % 50) + "/Family" + std::to_string(i) + ".otf",
-                         Value::dictionary({{"familyName", Value(Dictionary(std::move(names)))},
-                                            {"disabled", Value(i % 7 == 0)},
-                                            {"fontAssetName", Value(family)},
-                                            {"installDate", Value(Date{1.7e9 + i})},
-                                            {"fileSize", Value(100'000 + i)}}));
-  }
-  return Value(Dictionary(std::move(entries)));
-}
-
 struct Device {
   fs::path dir;
   Device() {
@@ -52,7 +33,7 @@ struct Device {
     dir = mkdtemp(pattern);
     fs::create_directories(dir / "root/var/mobile/Library/UserFonts");
     fs::create_directories(dir / "run");
-    Bytes bytes = CborCodec::encode(userFontsOf(10'000));
+    Bytes bytes = CborCodec::encode(bench::userFontsOf(10'000));
     std::ofstream(dir / "root/var/mobile/Library/UserFonts/UserFonts.plist", std::ios::binary)
         .write(reinterpret_cast<const char*>(bytes.data()),
                static_cast<std::streamsize>(bytes.size()));
