@@ -129,13 +129,4 @@ Value checkIn(const std::shared_ptr<IpcConnection>& connection) {
   return answer;
 }
 
-long statusField(pid_t pid, const char* field) {
-  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-  std::string line;
-  while (std::getline(status, line)) {
-    if (line.rfind(field, 0) == 0) return std::stol(line.substr(std::strlen(field)));
-  }
-  return -1;
-}
-
 }  // namespace typhora::bench

@@ -44,7 +44,4 @@ class BenchDevice {
 // One check-in on `connection`: its answer, or null when none came.
 Value checkIn(const std::shared_ptr<IpcConnection>& connection);
 
-// Resident kilobytes and threads of a process, from /proc.
-long statusField(pid_t pid, const char* field);
-
 }  // namespace typhora::bench

@@ -22,6 +22,7 @@
 #include "ipc/interface_descriptions.h"
 #include "platform/cbor_codec.h"
 #include "platform/linux/linux_platform.h"
+#include "platform/linux/proc_status.h"
 #include "platform/log.h"
 #include "private_bus.h"
 #include "raw_socket_peer.h"
@@ -206,7 +207,7 @@ void Comparison::fanout() {
   auto connection = device.connect(service);
   bench::checkIn(connection);
   std::this_thread::sleep_for(std::chrono::seconds(2));
-  const long before = statusField(device.pid(), "VmRSS:");
+  const long before = procStatusField(device.pid(), "VmRSS:");
   FanoutCrowd crowd(device.runtimeDir(), kClients, kProcesses);
   if (!crowd.ready()) {
     std::fprintf(stderr, "compare: the fan-out clients did not check in\n");
@@ -214,8 +215,8 @@ void Comparison::fanout() {
     return;
   }
   std::this_thread::sleep_for(std::chrono::seconds(6));  // idle pool workers leave
-  const long after = statusField(device.pid(), "VmRSS:");
-  const long threads = statusField(device.pid(), "Threads:");
+  const long after = procStatusField(device.pid(), "VmRSS:");
+  const long threads = procStatusField(device.pid(), "Threads:");
   char line[200];
   std::snprintf(line, sizeof line,
                 "daemon with %d fonts and %d checked-in connections: RSS %.1f MB, %ld threads, "

@@ -30,7 +30,7 @@ void ComparisonTable::print(const std::string& note) const {
   for (const ComparisonRow& row : rows_) {
     const double ours = row.typhora.median();
     const double theirs = row.peerSamples.median();
-    std::printf("%-34s %-10s %12.3f %6.0f%%  %-26s %12.3f %6.0f%% %8.3fx\n", row.workload.c_str(),
+    std::printf("%-34s %-10s %12.3f %6.0f%%  %-26s %12.3f %6.0f%% %9.3gx\n", row.workload.c_str(),
                 row.unit.c_str(), ours, row.typhora.spreadPercent(), row.peer.c_str(), theirs,
                 row.peerSamples.spreadPercent(), theirs > 0 ? ours / theirs : 0.0);
   }

@@ -17,6 +17,7 @@
 #include "ipc/interface_descriptions.h"
 #include "platform/cbor_codec.h"
 #include "platform/linux/lumo_service.h"
+#include "platform/linux/proc_status.h"
 
 namespace typhora {
 namespace {
@@ -73,15 +74,6 @@ bool firstAnsweredCall(LumoService& service, const Device& device) {
   return false;
 }
 
-long residentKilobytes(pid_t pid) {
-  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-  std::string line;
-  while (std::getline(status, line)) {
-    if (line.rfind("VmRSS:", 0) == 0) return std::stol(line.substr(6));
-  }
-  return -1;
-}
-
 void BM_ColdStartToFirstAnsweredCall(benchmark::State& state) {
   Device device;
   Device* d = &device;
@@ -94,7 +86,7 @@ void BM_ColdStartToFirstAnsweredCall(benchmark::State& state) {
     auto elapsed = std::chrono::duration<double>(Clock::now() - start).count();
     // The preload may still be reading when the first call is answered: let it finish.
     std::this_thread::sleep_for(std::chrono::milliseconds(150));
-    rss = residentKilobytes(pid);
+    rss = procStatusField(pid, "VmRSS:");
     kill(pid, SIGKILL);
     waitpid(pid, nullptr, 0);
     if (!ok) {

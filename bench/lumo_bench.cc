@@ -12,6 +12,7 @@
 
 #include "echo_service.h"
 #include "platform/linux/lumo_admission.h"
+#include "platform/linux/proc_status.h"
 #include "raw_socket_peer.h"
 
 namespace typhora {
@@ -63,22 +64,13 @@ void BM_LargeReply(benchmark::State& state) {
 }
 BENCHMARK(BM_LargeReply)->Unit(benchmark::kMillisecond)->UseRealTime();
 
-long statusField(const char* name) {
-  std::ifstream status("/proc/self/status");
-  std::string line;
-  while (std::getline(status, line)) {
-    if (line.rfind(name, 0) == 0) return std::stol(line.substr(std::strlen(name)));
-  }
-  return -1;
-}
-
 // Both ends of each connection live in this process: the figures are per pair of ends.
 void BM_ThousandIdleConnections(benchmark::State& state) {
   for (auto _ : state) {
     state.PauseTiming();
     std::this_thread::sleep_for(std::chrono::seconds(6));  // let idle pool workers leave
-    const long rssBefore = statusField("VmRSS:");
-    const long threadsBefore = statusField("Threads:");
+    const long rssBefore = procStatusField(getpid(), "VmRSS:");
+    const long threadsBefore = procStatusField(getpid(), "Threads:");
     // One user's thousand connections: past what a service lets one user hold.
     LumoAdmission::shared().setLimits({2000, 64, 128u << 20, 64});
     std::vector<std::shared_ptr<IpcConnection>> connections;
@@ -91,8 +83,9 @@ void BM_ThousandIdleConnections(benchmark::State& state) {
     }
     std::this_thread::sleep_for(std::chrono::seconds(6));
     state.counters["KB_per_connection"] =
-        static_cast<double>(statusField("VmRSS:") - rssBefore) / 1000.0;
-    state.counters["threads_added"] = static_cast<double>(statusField("Threads:") - threadsBefore);
+        static_cast<double>(procStatusField(getpid(), "VmRSS:") - rssBefore) / 1000.0;
+    state.counters["threads_added"] =
+        static_cast<double>(procStatusField(getpid(), "Threads:") - threadsBefore);
     for (auto& c : connections) c->invalidate();
     LumoAdmission::shared().setLimits({});
     state.ResumeTiming();
