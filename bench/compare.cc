@@ -7,7 +7,9 @@
 
 #include <chrono>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
+#include <filesystem>
 #include <fstream>
 #include <functional>
 #include <string>
@@ -302,6 +304,35 @@ int Comparison::run() {
 }  // namespace
 }  // namespace typhora::bench
 
+namespace {
+
+constexpr const char* kStrippedMark = "TYPHORA_COMPARE_STRIPPED";
+
+// The daemon reads the digest of an application's program at its first check-in after a start.
+// This program is the application of every check-in here, and its build with debug information
+// is some 40 MB, far past an application's size: it runs as a copy without that information.
+void runStripped(char** argv) {
+  if (std::getenv(kStrippedMark) != nullptr) return;
+  char pattern[] = "/tmp/typhora-compare-app-XXXXXX";
+  if (mkdtemp(pattern) == nullptr) return;
+  const std::string copy = std::string(pattern) + "/compare";
+  const std::string self = std::filesystem::canonical("/proc/self/exe").string();
+  const std::string command = "strip --strip-debug -o '" + copy + "' '" + self + "'";
+  if (std::system(command.c_str()) != 0) return;
+  setenv(kStrippedMark, pattern, 1);
+  execv(copy.c_str(), argv);
+}
+
+// Removes the stripped copy once the run is over (its children are gone by then).
+void removeStrippedCopy() {
+  if (const char* dir = std::getenv(kStrippedMark)) {
+    std::error_code ec;
+    std::filesystem::remove_all(dir, ec);
+  }
+}
+
+}  // namespace
+
 int main(int argc, char** argv) {
   using namespace typhora::bench;
   if (argc == 5 && std::strcmp(argv[1], "--fanout-client") == 0) {
@@ -319,5 +350,8 @@ int main(int argc, char** argv) {
       return arg == "--help" ? 0 : 2;
     }
   }
-  return Comparison(std::move(options)).run();
+  runStripped(argv);
+  const int status = Comparison(std::move(options)).run();
+  removeStrippedCopy();
+  return status;
 }

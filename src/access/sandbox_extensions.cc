@@ -67,7 +67,8 @@ Value TyphoraDaemon::filterUserFontInfoForAuditToken(const AuditToken& token,
 Value TyphoraDaemon::filterUserFontEntries(const AuditToken& token, bool withEnumerationCapability,
                                            const FontFilter& withFilter,
                                            const std::set<std::string>* onlyPaths) {
-  const bool sandboxed = isAuditTokenSandboxed(token);
+  // An enumerating caller receives the cached records whatever its sandbox: no need to ask.
+  const bool sandboxed = !withEnumerationCapability && isAuditTokenSandboxed(token);
   const Value info = userFontsInfo();
   const Dictionary* entries = info.asDictionary();
   if (entries == nullptr) return Value(Dictionary());
