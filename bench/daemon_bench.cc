@@ -12,10 +12,12 @@
 #include <string>
 #include <thread>
 
+#include "bench_device.h"
 #include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
-#include "platform/linux/lumo/lumo_service.h"
 #include "platform/value/cbor_codec.h"
+#include "platform/linux/lumo/lumo_service.h"
+#include "platform/linux/proc_status.h"
 
 namespace typhora {
 namespace {
@@ -25,26 +27,6 @@ using Clock = std::chrono::steady_clock;
 
 const std::string kDaemon = std::string(TYPHORA_BINARY_DIR) + "/src/typhorad";
 
-Value userFontsOf(int records) {
-  std::vector<DictionaryEntry> entries;
-  entries.reserve(static_cast<std::size_t>(records));
-  for (int i = 0; i < records; ++i) {
-    std::vector<DictionaryEntry> names;
-    const std::string family = "Family " + std::to_string(i);
-    for (int k = 0; k < 1 + i % 4; ++k) {
-      names.emplace_back("Family" + std::to_string(i) + "-Style" + std::to_string(k), family);
-    }
-    entries.emplace_back("/var/mobile/Library/UserFonts/FontFiles/com.example.provider" +
-                             std::to_string(i % 50) + "/Family" + std::to_string(i) + ".otf",
-                         Value::dictionary({{"familyName", Value(Dictionary(std::move(names)))},
-                                            {"disabled", Value(i % 7 == 0)},
-                                            {"fontAssetName", Value(family)},
-                                            {"installDate", Value(Date{1.7e9 + i})},
-                                            {"fileSize", Value(100'000 + i)}}));
-  }
-  return Value(Dictionary(std::move(entries)));
-}
-
 struct Device {
   fs::path dir;
   Device() {
@@ -52,7 +34,7 @@ struct Device {
     dir = mkdtemp(pattern);
     fs::create_directories(dir / "root/var/mobile/Library/UserFonts");
     fs::create_directories(dir / "run");
-    Bytes bytes = CborCodec::encode(userFontsOf(10'000));
+    Bytes bytes = CborCodec::encode(bench::userFontsOf(10'000));
     std::ofstream(dir / "root/var/mobile/Library/UserFonts/UserFonts.plist", std::ios::binary)
         .write(reinterpret_cast<const char*>(bytes.data()),
                static_cast<std::streamsize>(bytes.size()));
@@ -92,15 +74,6 @@ bool firstAnsweredCall(LumoService& service, const Device& device) {
   return false;
 }
 
-long residentKilobytes(pid_t pid) {
-  std::ifstream status("/proc/" + std::to_string(pid) + "/status");
-  std::string line;
-  while (std::getline(status, line)) {
-    if (line.rfind("VmRSS:", 0) == 0) return std::stol(line.substr(6));
-  }
-  return -1;
-}
-
 void BM_ColdStartToFirstAnsweredCall(benchmark::State& state) {
   Device device;
   Device* d = &device;
@@ -113,7 +86,7 @@ void BM_ColdStartToFirstAnsweredCall(benchmark::State& state) {
     auto elapsed = std::chrono::duration<double>(Clock::now() - start).count();
     // The preload may still be reading when the first call is answered: let it finish.
     std::this_thread::sleep_for(std::chrono::milliseconds(150));
-    rss = residentKilobytes(pid);
+    rss = procStatusField(pid, "VmRSS:");
     kill(pid, SIGKILL);
     waitpid(pid, nullptr, 0);
     if (!ok) {

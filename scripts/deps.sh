@@ -7,6 +7,7 @@ packages=(
   libcbor-dev libsodium-dev libsimdjson-dev libsystemd-dev libfreetype-dev
   libgtest-dev libgmock-dev libbenchmark-dev
   systemd procps fonts-dejavu-core
+  dbus-daemon fontconfig libfontconfig-dev
 )
 
 missing=()

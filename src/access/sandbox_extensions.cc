@@ -61,27 +61,42 @@ Value TyphoraDaemon::sandboxExtensionForProvider(const AuditToken& token,
 Value TyphoraDaemon::filterUserFontInfoForAuditToken(const AuditToken& token,
                                                      bool withEnumerationCapability,
                                                      const FontFilter& withFilter) {
-  const bool sandboxed = isAuditTokenSandboxed(token);
+  return filterUserFontEntries(token, withEnumerationCapability, withFilter, nullptr);
+}
+
+Value TyphoraDaemon::filterUserFontEntries(const AuditToken& token, bool withEnumerationCapability,
+                                           const FontFilter& withFilter,
+                                           const std::set<std::string>* onlyPaths) {
+  // An enumerating caller receives the cached records whatever its sandbox: no need to ask.
+  const bool sandboxed = !withEnumerationCapability && isAuditTokenSandboxed(token);
   const Value info = userFontsInfo();
   const Dictionary* entries = info.asDictionary();
   if (entries == nullptr) return Value(Dictionary());
   std::vector<DictionaryEntry> result;
-  for (const auto& [path, record] : entries->entries()) {
+  auto visit = [&](const std::string& path, const Value& record) {
     bool covered = false;
-    if (!withFilter(path, record, &covered)) continue;
+    if (!withFilter(path, record, &covered)) return;
     if (isAssetStorePath(path)) covered = true;
     if (!sandboxed || withEnumerationCapability) {
       result.emplace_back(path, record);  // the cached record itself
-      continue;
+      return;
     }
     if (covered) {
       result.emplace_back(path, copyForClient(record, Value()));
-      continue;
+      return;
     }
     // A sandboxed caller that can already read the file gets nothing for it.
-    if (platform_.sandbox.sandboxCheck(token, kSandboxOperationFileReadData, path) == 0) continue;
+    if (platform_.sandbox.sandboxCheck(token, kSandboxOperationFileReadData, path) == 0) return;
     std::optional<std::string> issued = platform_.sandbox.issueReadOnlyExtension(path, token);
     result.emplace_back(path, copyForClient(record, issued ? tokenValue(*issued) : Value()));
+  };
+  if (onlyPaths != nullptr) {
+    // Both are ordered by path: the entries are visited in the same order as by the walk.
+    for (const std::string& path : *onlyPaths) {
+      if (const Value* record = entries->find(path)) visit(path, *record);
+    }
+  } else {
+    for (const auto& [path, record] : entries->entries()) visit(path, record);
   }
   return Value(Dictionary(std::move(result)));
 }
@@ -91,12 +106,15 @@ Value TyphoraDaemon::fontInfoForAuditToken(
     const std::optional<std::string>& identifier,
     const std::optional<std::set<std::string>>& andFileFilters,
     std::optional<std::string>* foundFontDirectoryName) {
+  // Every enumerating caller receives the same records: they are filtered once per load.
+  if (withEnumuration && !andFileFilters) return enabledUserFontsInfo();
   std::optional<std::string> directory;
   if (installation && identifier && !withEnumuration)
     directory = platform_.fontManager.directoryNameFromIdentifier(*identifier);
   bool found = false;
-  Value result = filterUserFontInfoForAuditToken(
-      token, withEnumuration, [&](const std::string& path, const Value& record, bool* covered) {
+  Value result = filterUserFontEntries(
+      token, withEnumuration,
+      [&](const std::string& path, const Value& record, bool* covered) {
         if (andFileFilters && !andFileFilters->contains(path)) return false;
         if (isDisabled(record)) return false;
         if (withEnumuration) return true;
@@ -105,7 +123,8 @@ Value TyphoraDaemon::fontInfoForAuditToken(
         *covered = true;
         found = true;
         return true;
-      });
+      },
+      andFileFilters ? &*andFileFilters : nullptr);
   if (foundFontDirectoryName != nullptr && found) *foundFontDirectoryName = directory;
   return result;
 }
@@ -121,27 +140,26 @@ void TyphoraDaemon::setupUserInstalledFontsFor(const AuditToken& token,
     return;
   }
   mainHandlerQueue().sync([&] {
-    std::vector<DictionaryEntry> fonts;
+    Value fontsInfo = Value(Dictionary());
     std::optional<std::string> directory;
     if (hasEnumeration || isFontProvider) {
-      Value found = fontInfoForAuditToken(token, hasEnumeration, isFontProvider, processIdentifier,
-                                          std::nullopt, &directory);
-      fonts = found.asDictionary()->entries();
+      fontsInfo = fontInfoForAuditToken(token, hasEnumeration, isFontProvider, processIdentifier,
+                                        std::nullopt, &directory);
     }
     if (!hasEnumeration && hasFontAccess && processIdentifier) {
       const std::vector<std::string> issued = issuedFontFilePathsForIdentifier(*processIdentifier);
       const std::set<std::string> wanted(issued.begin(), issued.end());
-      Value granted = filterUserFontInfoForAuditToken(
-          token, false, [&wanted](const std::string& path, const Value&, bool*) {
-            return wanted.contains(path);
-          });
+      Value granted = filterUserFontEntries(
+          token, false, [](const std::string&, const Value&, bool*) { return true; }, &wanted);
       // Entries of the same path replace the earlier ones: the later entry wins.
+      std::vector<DictionaryEntry> fonts = fontsInfo.asDictionary()->entries();
       for (const auto& entry : granted.asDictionary()->entries()) fonts.push_back(entry);
+      fontsInfo = Value(Dictionary(std::move(fonts)));
     }
     // Room for every key up front: "fontsInfo" and at most two of the others.
     std::vector<DictionaryEntry> checkin;
     checkin.reserve(3);
-    checkin.emplace_back("fontsInfo", Value(Dictionary(std::move(fonts))));
+    checkin.emplace_back("fontsInfo", std::move(fontsInfo));
     if (hasEnumeration) {
       if (Value extension = sandboxExtensionForEnumeration(token); !extension.isNull())
         checkin.emplace_back("extension", extension);

@@ -1,5 +1,7 @@
 // Font names against the installed user fonts: which requested families are enabled, disabled
-// or unknown, and which provider applications supply a family or a PostScript name.
+// or unknown, and which provider applications supply a family or a PostScript name. Look-ups go
+// through the name index of the loaded information; providers are asked of the registry on each
+// call, as a provider's directory may come and go between font changes.
 #include <algorithm>
 
 #include "daemon/paths.h"
@@ -7,57 +9,21 @@
 
 namespace typhora {
 
-namespace {
-
-bool isEnabled(const Value& record) {
-  return record.get("disabled").asBool() != true;
-}
-
-bool hasFamily(const Value& record, const std::string& familyName) {
-  const Dictionary* names = record.get("familyName").asDictionary();
-  if (names == nullptr) return false;
-  return std::any_of(names->entries().begin(), names->entries().end(), [&](const auto& entry) {
-    const std::string* family = entry.second.asString();
-    return family != nullptr && *family == familyName;
-  });
-}
-
-const std::vector<DictionaryEntry>& filesOf(const Value& info) {
-  static const std::vector<DictionaryEntry> none;
-  const Dictionary* files = info.asDictionary();
-  return files != nullptr ? files->entries() : none;
-}
-
-}  // namespace
-
 bool TyphoraDaemon::isKnownFamilyName(const std::string& familyName, bool* withEnabledState) {
-  bool found = false;
-  bool enabled = false;
-  const Value info = userFontsInfo();
-  for (const auto& [path, record] : filesOf(info)) {
-    if (!hasFamily(record, familyName)) continue;
-    found = true;
-    enabled = isEnabled(record);
-    break;
-  }
-  if (withEnabledState != nullptr) *withEnabledState = enabled;
-  return found;
+  const auto index = userFontsNameIndex();
+  const auto& files = index->filesOfFamily(familyName);
+  // The first file in path order decides the enabled state.
+  if (withEnabledState != nullptr) *withEnabledState = !files.empty() && files.front().enabled;
+  return !files.empty();
 }
 
 std::optional<std::string> TyphoraDaemon::knownFamilyNameFromPostScriptName(
     const std::string& postScriptName, bool* withEnabledState) {
-  std::optional<std::string> family;
-  bool enabled = false;
-  const Value info = userFontsInfo();
-  for (const auto& [path, record] : filesOf(info)) {
-    const std::string* name = record.get("familyName").get(postScriptName).asString();
-    if (name == nullptr) continue;
-    family = *name;
-    enabled = isEnabled(record);
-    break;
-  }
-  if (withEnabledState != nullptr) *withEnabledState = enabled;
-  return family;
+  const auto index = userFontsNameIndex();
+  const auto& files = index->filesOfPostScriptName(postScriptName);
+  if (withEnabledState != nullptr) *withEnabledState = !files.empty() && files.front().enabled;
+  if (files.empty()) return std::nullopt;
+  return std::string(files.front().family);
 }
 
 std::vector<std::string> TyphoraDaemon::unknownFontNamesAndEnabledFamilyNames(
@@ -103,10 +69,9 @@ std::optional<std::string> TyphoraDaemon::identifierFromFilePath(const std::stri
 std::set<std::string> TyphoraDaemon::providerIdentifiersFromFamilyName(
     const std::string& familyName) {
   std::set<std::string> providers;
-  const Value info = userFontsInfo();
-  for (const auto& [path, record] : filesOf(info)) {
-    if (!hasFamily(record, familyName)) continue;
-    if (std::optional<std::string> identifier = identifierFromFilePath(path))
+  const auto index = userFontsNameIndex();
+  for (const UserFontsNameIndex::File& file : index->filesOfFamily(familyName)) {
+    if (std::optional<std::string> identifier = identifierFromFilePath(std::string(file.path)))
       providers.insert(*identifier);
   }
   return providers;
@@ -115,16 +80,14 @@ std::set<std::string> TyphoraDaemon::providerIdentifiersFromFamilyName(
 std::set<std::string> TyphoraDaemon::providerIdentifiersAndFamilyName(
     std::optional<std::string>* familyName, const std::string& fromPostScriptName) {
   std::set<std::string> providers;
-  std::optional<std::string> family;
-  const Value info = userFontsInfo();
-  for (const auto& [path, record] : filesOf(info)) {
-    const std::string* name = record.get("familyName").get(fromPostScriptName).asString();
-    if (name == nullptr) continue;
-    family = *name;  // the last matching file's family is the one reported
-    if (std::optional<std::string> identifier = identifierFromFilePath(path))
+  const auto index = userFontsNameIndex();
+  const auto& files = index->filesOfPostScriptName(fromPostScriptName);
+  for (const UserFontsNameIndex::File& file : files) {
+    if (std::optional<std::string> identifier = identifierFromFilePath(std::string(file.path)))
       providers.insert(*identifier);
   }
-  *familyName = family;
+  // The last matching file's family is the one reported.
+  *familyName = files.empty() ? std::nullopt : std::optional<std::string>(files.back().family);
   return providers;
 }
 

@@ -2,6 +2,7 @@
 // fonts change, and read again by the first reader after that.
 #include <string>
 
+#include "catalog/font_record.h"
 #include "daemon/typhora_daemon.h"
 #include "platform/log/log.h"
 
@@ -39,11 +40,38 @@ Value TyphoraDaemon::userFontsInfo() {
 void TyphoraDaemon::setUserFontsInfo(Value info) {
   std::lock_guard lock(userFontsInfoMutex_);
   userFontsInfo_ = std::move(info);
+  userFontsNameIndex_.reset();
+  enabledUserFontsInfo_ = Value();
 }
 
 void TyphoraDaemon::invalidateUserFonts() {
   std::lock_guard lock(userFontsInfoMutex_);
   userFontsInfo_ = Value();
+  userFontsNameIndex_.reset();
+  enabledUserFontsInfo_ = Value();
+}
+
+std::shared_ptr<const UserFontsNameIndex> TyphoraDaemon::userFontsNameIndex() {
+  std::lock_guard lock(userFontsInfoMutex_);
+  if (!userFontsNameIndex_) {
+    userFontsNameIndex_ = std::make_shared<const UserFontsNameIndex>(loadedUserFontsInfoLocked());
+  }
+  return userFontsNameIndex_;
+}
+
+Value TyphoraDaemon::enabledUserFontsInfo() {
+  std::lock_guard lock(userFontsInfoMutex_);
+  if (enabledUserFontsInfo_.isNull()) {
+    std::vector<DictionaryEntry> enabled;
+    if (const Dictionary* entries = loadedUserFontsInfoLocked().asDictionary()) {
+      enabled.reserve(entries->size());
+      for (const auto& entry : *entries) {
+        if (!FontRecord::isDisabled(entry.second)) enabled.push_back(entry);
+      }
+    }
+    enabledUserFontsInfo_ = Value(Dictionary(std::move(enabled)));
+  }
+  return enabledUserFontsInfo_;
 }
 
 std::string TyphoraDaemon::userFontsFilePath() {

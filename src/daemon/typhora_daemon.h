@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "catalog/user_fonts_name_index.h"
 #include "ipc/local_notification_center.h"
 #include "platform/dispatch/one_shot_timer.h"
 #include "platform/dispatch/serial_queue.h"
@@ -101,10 +102,16 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   Value _userFontsInfoFromDisk();
   // The daemon's path of the user-fonts file.
   static std::string userFontsFilePath();
+  // The names of the loaded information, indexed by the first look-up after a load and dropped
+  // with the cache.
+  std::shared_ptr<const UserFontsNameIndex> userFontsNameIndex();
+  // The enabled entries, the cached records themselves, as every enumerating caller receives
+  // them: filtered by the first such caller after a load and dropped with the cache.
+  Value enabledUserFontsInfo();
 
   // --- Font catalog: name resolution (catalog/name_resolution.cc) ---
-  // Every look-up walks the cached user-fonts information in its order (by path); names are
-  // compared exactly.
+  // Every look-up answers as a walk of the cached user-fonts information in its order (by path)
+  // would, through the name index; names are compared exactly.
 
   bool isKnownFamilyName(const std::string& familyName, bool* withEnabledState);
   std::optional<std::string> knownFamilyNameFromPostScriptName(const std::string& postScriptName,
@@ -262,6 +269,10 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   // (bounded, refusing paths that are not plain), and removing the due files.
   void addPendingDeletions(const std::vector<std::string>& paths, std::uint32_t delay);
   void removeDueFontFiles(const std::vector<std::string>& due);
+  // filterUserFontInfoForAuditToken over the entries at `onlyPaths` alone (looked up, in path
+  // order, as the walk would meet them), or over every entry when it is null.
+  Value filterUserFontEntries(const AuditToken& token, bool withEnumerationCapability,
+                              const FontFilter& withFilter, const std::set<std::string>* onlyPaths);
   // The cache, loaded from disk when absent. Called with userFontsInfoMutex_ held.
   const Value& loadedUserFontsInfoLocked();
   std::vector<std::string> issuedFontFilePathsLocked(const Dictionary* issues,
@@ -280,6 +291,9 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   // queue's jobs never take it, so it cannot deadlock.
   std::mutex userFontsInfoMutex_;
   Value userFontsInfo_;
+  // Derived from userFontsInfo_ when first asked for; null whenever the cache is.
+  std::shared_ptr<const UserFontsNameIndex> userFontsNameIndex_;
+  Value enabledUserFontsInfo_;
 
   // Only keeps the service listener open for the life of the process; nothing reads it.
   std::shared_ptr<IpcListener> listener_;

@@ -98,6 +98,32 @@ TEST_F(CheckinTest, EnumerationGetsEveryEnabledCachedRecordAndDirectoryTokens) {
       setup(true, false, false, "com.shop").asDictionary()->contains("extension.fontasset"));
 }
 
+// Every enumerating caller receives the same records, filtered once per loaded generation; only
+// the tokens are its own. Dropping the cache drops them.
+TEST_F(CheckinTest, EnumeratingCallersShareTheRecordsOfAGenerationAndNotTheirTokens) {
+  constexpr AuditToken kOther{.pid = 77, .uid = 502, .startTime = 5, .exeInode = 6};
+  auto checkinOf = [this](const AuditToken& caller) {
+    std::optional<std::vector<Value>> reply;
+    daemon_->setupUserInstalledFontsFor(caller, caller, true, false, false, "com.any",
+                                        [&reply](std::vector<Value> r) { reply = std::move(r); });
+    return reply ? reply->at(0) : Value();
+  };
+  Value first = checkinOf(kClient);
+  Value second = checkinOf(kOther);  // not sandboxed
+  EXPECT_EQ(first.get("fontsInfo"), second.get("fontsInfo"));
+  EXPECT_THAT(keys(second.get("fontsInfo")),
+              UnorderedElementsAre(kOtherC, kShopA, kAssetS, kStoreX));
+  EXPECT_EQ(first.get("extension"), token("/var/mobile/Library/UserFonts/FontFiles", 42));
+  EXPECT_EQ(second.get("extension"), token("/var/mobile/Library/UserFonts/FontFiles", 77));
+
+  fake_.fileSystem.writeFile("/var/mobile/Library/UserFonts/UserFonts.plist",
+                             JsonCodec::encode(Value::dictionary({{kShopB, record("B", false)}})));
+  EXPECT_EQ(keys(checkinOf(kOther).get("fontsInfo")), keys(first.get("fontsInfo")));
+  daemon_->invalidateUserFonts();
+  EXPECT_THAT(keys(checkinOf(kOther).get("fontsInfo")), ElementsAre(kShopB));
+  EXPECT_THAT(keys(checkinOf(kClient).get("fontsInfo")), ElementsAre(kShopB));
+}
+
 TEST_F(CheckinTest, AProviderGetsItsOwnEnabledFontsAndItsDirectory) {
   Value checkin = setup(false, false, true, "com.shop");
   Value a = record("A", false);

@@ -88,6 +88,46 @@ TEST_F(NameResolutionTest, ProvidersComeFromTheDirectoriesOfEveryMatchingFile) {
   EXPECT_FALSE(enabled);
 }
 
+// Look-ups answer from the generation loaded last: a font change drops its names with the cache,
+// and the next look-up sees what the file holds then, first and last matching files included.
+TEST_F(NameResolutionTest, AFontChangeDropsTheNamesAndTheNextGenerationAnswersAfresh) {
+  bool enabled = false;
+  EXPECT_TRUE(daemon_->isKnownFamilyName("A", &enabled));
+  fake_.fileSystem.writeFile("/var/mobile/Library/UserFonts/UserFonts.plist", R"({
+      "/var/mobile/Library/UserFonts/FontFiles/com.b/B.otf":
+          {"familyName": {"A-Regular": "A", "E-Regular": "E"}, "disabled": true},
+      "/var/mobile/Library/UserFonts/FontFiles/com.c/C.otf":
+          {"familyName": {"A-Regular": "Z", "E-Bold": "E", "Q-Regular": 3}},
+      "/var/mobile/Library/UserFonts/FontFiles/com.c/Odd.otf": 7})");
+  EXPECT_FALSE(daemon_->isKnownFamilyName("E", nullptr));  // not told yet
+
+  daemon_->fontChanged(Value::dictionary({}), [](std::vector<Value>) {});
+  daemon_->mainHandlerQueue().sync([] {});
+  EXPECT_TRUE(daemon_->isKnownFamilyName("E", &enabled));
+  EXPECT_FALSE(enabled);  // the first file by path decides
+  EXPECT_EQ(daemon_->knownFamilyNameFromPostScriptName("A-Regular", &enabled), "A");
+  EXPECT_FALSE(enabled);
+  std::optional<std::string> family;
+  EXPECT_THAT(daemon_->providerIdentifiersAndFamilyName(&family, "A-Regular"),
+              ElementsAre("com.b", "com.c"));
+  EXPECT_EQ(family, "Z");  // the last file by path
+  EXPECT_THAT(daemon_->providerIdentifiersFromFamilyName("E"), ElementsAre("com.b", "com.c"));
+  EXPECT_EQ(daemon_->knownFamilyNameFromPostScriptName("Q-Regular", nullptr), std::nullopt);
+  EXPECT_THAT(sort({request("C", nullptr), request("E", "E-Bold")}), ElementsAre("C"));
+  EXPECT_THAT(enabled_, ElementsAre("E"));
+  EXPECT_THAT(disabled_, IsEmpty());
+
+  // Replacing the information through the setter replaces its names too.
+  daemon_->setUserFontsInfo(Value::dictionary(
+      {{"/var/mobile/Library/UserFonts/FontFiles/com.a/F.otf",
+        Value::dictionary({{"familyName", Value::dictionary({{"F-Regular", "F"}})}})}}));
+  EXPECT_TRUE(daemon_->isKnownFamilyName("F", nullptr));
+  EXPECT_FALSE(daemon_->isKnownFamilyName("E", nullptr));
+  daemon_->invalidateUserFonts();
+  EXPECT_FALSE(daemon_->isKnownFamilyName("F", nullptr));
+  EXPECT_TRUE(daemon_->isKnownFamilyName("E", nullptr));
+}
+
 TEST_F(NameResolutionTest, WithoutUserFontsEveryNameIsUnknown) {
   fake_.fileSystem.removeFile("/var/mobile/Library/UserFonts/UserFonts.plist");
   EXPECT_THAT(sort({request("A", "A-Regular")}), ElementsAre("A"));

@@ -10,6 +10,7 @@
 #include <iterator>
 
 #include "integration/daemon_test_base.h"
+#include "platform/value/json_codec.h"
 
 namespace typhora::testing {
 namespace {
@@ -80,6 +81,35 @@ TEST_F(CheckinProcessTest, AProgramChangedInPlaceLosesItsIdentity) {
   auto changed = checkin(shop);
   ASSERT_EQ(changed.status, 0) << changed.all;
   EXPECT_EQ(changed.out, "[null]\n");
+}
+
+// The load's client processes each check in, report font changes and request a font; every call
+// is answered, each is told of the changes, and the report names the daemon it measured.
+TEST_F(CheckinProcessTest, LoadClientsCheckInReportChangesAndMeasureTheDaemon) {
+  const std::string browser = install("browser", "com.example.browser", R"(["font-enumeration"])");
+  startDaemon();
+  auto run =
+      runCommand({browser, "--runtime-dir", runtime_, "load", "--clients", "3", "--seconds", "2",
+                  "--change-every", "0.5", "--request-every", "1", "--family", "A", "--changed-url",
+                  "file:///var/mobile/Library/UserFonts/FontFiles/com.example.shop/A.otf"},
+                 60s);
+  ASSERT_EQ(run.status, 0) << run.all;
+  const std::optional<Value> report = JsonCodec::decode(run.out);
+  ASSERT_TRUE(report.has_value()) << run.out;
+  EXPECT_EQ(report->get("errors"), Value(ValueArray{}));
+  for (const char* operation : {"checkin", "fontChanged", "requestFonts"}) {
+    const Value& figures = report->get("operations").get(operation);
+    EXPECT_GT(figures.get("calls").asInt().value_or(0), 0) << operation;
+    EXPECT_EQ(figures.get("errors"), Value(0)) << operation;
+    EXPECT_LE(figures.get("p50").asDouble().value_or(-1),
+              figures.get("max").asDouble().value_or(0));
+  }
+  // Each client is told of the changes of all three.
+  EXPECT_GE(report->get("notifications").asInt().value_or(0),
+            report->get("operations").get("fontChanged").get("calls").asInt().value_or(1));
+  EXPECT_EQ(report->get("daemon").get("pid"), Value(static_cast<std::int64_t>(daemon_->pid())));
+  EXPECT_GT(report->get("daemon").get("threads").asInt().value_or(0), 0);
+  EXPECT_GT(report->get("daemon").get("rssKB").at(0).asInt().value_or(0), 0);
 }
 
 }  // namespace

@@ -1,5 +1,7 @@
 #include "load_command.h"
 
+#include "load_mix.h"
+
 #include <algorithm>
 #include <atomic>
 #include <chrono>
@@ -19,10 +21,20 @@ using Clock = std::chrono::steady_clock;
 
 constexpr const char* kUsage =
     "usage: typhoractl load [--connections N] [--calls M] OPERATION [JSON-ARGUMENT...]\n"
+    "       typhoractl load --clients N [--seconds S] [--change-every S] [--request-every S]\n"
+    "                       [--family NAME] [--changed-url URL]\n"
     "\n"
     "Opens N connections to the daemon (default 100), then has each send M calls of OPERATION\n"
     "(default 1) at once, and waits for every answer. Prints one JSON object: the counts, the\n"
-    "time from the first call to the last answer, and the latencies of the answers (ms).\n";
+    "time from the first call to the last answer, and the latencies of the answers (ms).\n"
+    "\n"
+    "With --clients: N client processes (default 50), each on its own connection, check in\n"
+    "over and over for S seconds (default 60); each also reports a font change of URL every\n"
+    "--change-every seconds (default 5) and requests family NAME (default DejaVu Sans) every\n"
+    "--request-every seconds (default 60; requests pass the daemon one at a time), 0 for never.\n"
+    "Prints one JSON object: per operation the calls, errors, calls per second and p50, p99 and\n"
+    "max latency (ms); the font changes the clients were told of; the daemon's resident memory\n"
+    "(kB) every 5 s and its threads at the end; and the errors. Stops by itself.\n";
 
 struct Run {
   std::size_t connections = 100;
@@ -59,10 +71,45 @@ bool parse(std::vector<std::string> args, Run* run) {
   return typhoraDaemonProtocol()->find(run->wireName) != nullptr;
 }
 
-double percentile(std::vector<double> sorted, double p) {
-  if (sorted.empty()) return 0;
-  const auto at = static_cast<std::size_t>(p * static_cast<double>(sorted.size() - 1));
-  return sorted[at];
+// `--clients` and its options: the mixed run of client processes.
+bool parseMix(std::vector<std::string> args, LoadPlan* plan) {
+  auto number = [](const std::string& text, double* out, double max) {
+    try {
+      std::size_t used = 0;
+      *out = std::stod(text, &used);
+      return used == text.size() && *out >= 0 && *out <= max;
+    } catch (...) {
+      return false;
+    }
+  };
+  while (args.size() >= 2 && args[0].starts_with("--")) {
+    const std::string& value = args[1];
+    double n = 0;
+    if (args[0] == "--clients" && number(value, &n, 1000) && n >= 1) {
+      plan->clients = static_cast<int>(n);
+    } else if (args[0] == "--seconds" && number(value, &n, 3600) && n > 0) {
+      plan->seconds = n;
+    } else if (args[0] == "--change-every" && number(value, &n, 3600)) {
+      plan->changeEverySeconds = n;
+    } else if (args[0] == "--request-every" && number(value, &n, 3600)) {
+      plan->requestEverySeconds = n;
+    } else if (args[0] == "--family") {
+      plan->family = value;
+    } else if (args[0] == "--changed-url") {
+      plan->changedUrl = value;
+    } else {
+      return false;
+    }
+    args.erase(args.begin(), args.begin() + 2);
+  }
+  return args.empty();
+}
+
+bool isMix(const std::vector<std::string>& args) {
+  return std::any_of(args.begin(), args.end(), [](const std::string& arg) {
+    return arg == "--clients" || arg == "--seconds" || arg == "--change-every" ||
+           arg == "--request-every";
+  });
 }
 
 }  // namespace
@@ -72,6 +119,14 @@ int runLoadCommand(const ClientOptions& options, const std::vector<std::string>&
   if (!args.empty() && (args[0] == "--help" || args[0] == "-h")) {
     std::cout << kUsage;
     return 0;
+  }
+  if (isMix(args)) {
+    LoadPlan plan;
+    if (!parseMix(args, &plan)) {
+      std::cerr << kUsage;
+      return 2;
+    }
+    return LoadMix(options, plan).run();
   }
   if (!parse(args, &run)) {
     std::cerr << kUsage;
