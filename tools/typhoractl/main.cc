@@ -9,9 +9,10 @@
 #include "app_state_command.h"
 #include "client_command.h"
 #include "event_command.h"
-#include "load_command.h"
+#include "font_command.h"
 #include "font_names_command.h"
 #include "font_picker_command.h"
+#include "load_command.h"
 #include "plist_command.h"
 #include "request_fonts_command.h"
 #include "view_service_command.h"
@@ -37,6 +38,8 @@ constexpr const char* kUsage =
     "  picker-client         an application that starts the font picker with its endpoint\n"
     "  pick NAME             the font picker delivering NAME's family to its client\n"
     "  font-names FILE       a font file's PostScript and family names, as JSON\n"
+    "  font install|remove|enable|disable|list   the font registry under the device root\n"
+    "  client [--watch]      check in as an application; --watch prints font changes\n"
     "\n"
     "  --runtime-dir DIR     where the daemon's socket is (default $TYPHORA_RUNTIME_DIR,\n"
     "                        else /run/typhora)\n"
@@ -92,6 +95,7 @@ int main(int argc, char** argv) {
   if (args[0] == "picker-client") return typhora::ctl::runPickerClientCommand(options, rest);
   if (args[0] == "pick") return typhora::ctl::runPickCommand(options, rest);
   if (args[0] == "font-names") return typhora::ctl::runFontNamesCommand(rest);
+  if (args[0] == "font") return typhora::ctl::runFontCommand(options, root, rest);
   if (args[0] == "activity")
     return typhora::ctl::runActivityCommand(options, {args.begin() + 1, args.end()});
   return typhora::ctl::runClientCommand(options, args);
