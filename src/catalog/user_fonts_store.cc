@@ -44,6 +44,12 @@ void TyphoraDaemon::setUserFontsInfo(Value info) {
 void TyphoraDaemon::invalidateUserFonts() {
   std::lock_guard lock(userFontsInfoMutex_);
   userFontsInfo_ = Value();
+  ++userFontsGeneration_;
+}
+
+bool TyphoraDaemon::isUserFontsInfoCached() {
+  std::lock_guard lock(userFontsInfoMutex_);
+  return !userFontsInfo_.isNull();
 }
 
 std::string TyphoraDaemon::userFontsFilePath() {

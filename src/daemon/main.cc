@@ -13,6 +13,7 @@
 
 #include "daemon/typhora_daemon.h"
 #include "platform/linux/device_root.h"
+#include "platform/linux/event_socket_protocol.h"
 #include "platform/linux/heap_reserve.h"
 #include "platform/linux/linux_platform.h"
 #include "platform/linux/lumo_connection.h"
@@ -125,6 +126,11 @@ int main(int argc, char** argv) {
   static typhora::LinuxPlatform platform(options.root, options.runtimeDir);
   typhora::TyphoraDaemon::installPlatform(platform.bundle());
   typhora::TyphoraDaemon& daemon = typhora::TyphoraDaemon::sharedDaemon();
+  platform.setReporter([&daemon](const std::string& operation, const typhora::Value& argument) {
+    if (operation == typhora::eventop::kStatusReport) return daemon.statusReport();
+    const std::string* identifier = argument.asString();
+    return daemon.grantsReport(identifier != nullptr ? std::optional(*identifier) : std::nullopt);
+  });
   // The event socket opens after the service socket, which so keeps a lone unnamed activated
   // socket. An event that started the daemon waits in the socket's backlog until then, and in its
   // launch event stream until the daemon's handler is installed.

@@ -56,6 +56,8 @@ void TyphoraHandler::checkin(const IpcReply& reply) {
     hasEnumerationEntitlement_ = enumeration;
     hasFontAccessEntitlement_ = fontAccess;
     isFontProvider_ = provider;
+    checkedIn_ = true;
+    signingIdentifier_ = identifier;
   }
   if (isProcessIdentifierToIgnore(identifier ? &*identifier : nullptr)) {
     reply({Value()});

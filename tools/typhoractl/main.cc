@@ -15,6 +15,7 @@
 #include "load_command.h"
 #include "plist_command.h"
 #include "request_fonts_command.h"
+#include "status_command.h"
 #include "view_service_command.h"
 #include "web_content_command.h"
 
@@ -40,6 +41,8 @@ constexpr const char* kUsage =
     "  font-names FILE       a font file's PostScript and family names, as JSON\n"
     "  font install|remove|enable|disable|list   the font registry under the device root\n"
     "  client [--watch]      check in as an application; --watch prints font changes\n"
+    "  status [--table|--metrics]   the daemon's state (event socket: root or its user)\n"
+    "  grants [APP] [--table]       the fonts issued to each application\n"
     "\n"
     "  --runtime-dir DIR     where the daemon's socket is (default $TYPHORA_RUNTIME_DIR,\n"
     "                        else /run/typhora)\n"
@@ -96,6 +99,8 @@ int main(int argc, char** argv) {
   if (args[0] == "pick") return typhora::ctl::runPickCommand(options, rest);
   if (args[0] == "font-names") return typhora::ctl::runFontNamesCommand(rest);
   if (args[0] == "font") return typhora::ctl::runFontCommand(options, root, rest);
+  if (args[0] == "status") return typhora::ctl::runStatusCommand(options, rest);
+  if (args[0] == "grants") return typhora::ctl::runGrantsCommand(options, rest);
   if (args[0] == "activity")
     return typhora::ctl::runActivityCommand(options, {args.begin() + 1, args.end()});
   return typhora::ctl::runClientCommand(options, args);
