@@ -24,15 +24,18 @@ namespace {
 constexpr const char* kUsage =
     "usage: typhorad [--root DIR] [--runtime-dir DIR] [--log-level debug|info|error]\n"
     "                [--log-target stderr|journal]\n"
+    "       typhorad --version\n"
     "\n"
-    "  --root DIR         device root under which every path of the daemon lives (default /)\n"
+    "  --root DIR         device root under which every path of the daemon lives\n"
+    "                     (default " TYPHORA_DEFAULT_ROOT
+    ")\n"
     "  --runtime-dir DIR  where the service socket is made (default $RUNTIME_DIRECTORY,\n"
     "                     else /run/typhora); ignored under systemd socket activation\n"
     "  --log-level L      lowest level logged (default info)\n"
     "  --log-target T     stderr, or the journal (default: journal when started by systemd)\n";
 
 struct Options {
-  std::string root = "/";
+  std::string root = TYPHORA_DEFAULT_ROOT;
   std::string runtimeDir;
   typhora::LogLevel level = typhora::LogLevel::Info;
   std::string target;
@@ -65,6 +68,9 @@ Options parseOptions(int argc, char** argv) {
     };
     if (arg == "--help" || arg == "-h") {
       std::fputs(kUsage, stdout);
+      std::exit(0);
+    } else if (arg == "--version") {
+      std::puts("typhorad " TYPHORA_VERSION);
       std::exit(0);
     } else if (arg == "--root") {
       options.root = next();

@@ -46,7 +46,9 @@ constexpr const char* kUsage =
     "\n"
     "  --runtime-dir DIR     where the daemon's socket is (default $TYPHORA_RUNTIME_DIR,\n"
     "                        else /run/typhora)\n"
-    "  --root DIR            the device root (default $TYPHORA_ROOT, else /)\n"
+    "  --root DIR            the device root (default $TYPHORA_ROOT, else " TYPHORA_DEFAULT_ROOT
+    ")\n"
+    "  --version             print the version\n"
     "Each command takes --help.\n";
 
 }  // namespace
@@ -58,11 +60,15 @@ int main(int argc, char** argv) {
   const char* fromEnv = std::getenv("TYPHORA_RUNTIME_DIR");
   options.runtimeDir = fromEnv != nullptr ? fromEnv : "/run/typhora";
   const char* rootFromEnv = std::getenv("TYPHORA_ROOT");
-  std::string root = rootFromEnv != nullptr ? rootFromEnv : "/";
+  std::string root = rootFromEnv != nullptr ? rootFromEnv : TYPHORA_DEFAULT_ROOT;
 
   while (!args.empty() && args[0].starts_with("--")) {
     if (args[0] == "--help" || args[0] == "-h") {
       std::cout << kUsage;
+      return 0;
+    }
+    if (args[0] == "--version") {
+      std::cout << "typhoractl " TYPHORA_VERSION "\n";
       return 0;
     }
     if (args[0] == "--runtime-dir" && args.size() >= 2) {

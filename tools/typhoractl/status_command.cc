@@ -56,7 +56,8 @@ std::string capabilities(const Value& record) {
   std::string names;
   for (const char* name : {"enumeration", "fontAccess", "provider"}) {
     if (record.get(name).asBool() != true) continue;
-    names += (names.empty() ? "" : ",") + std::string(name);
+    if (!names.empty()) names += ',';
+    names += name;
   }
   return names.empty() ? "-" : names;
 }
