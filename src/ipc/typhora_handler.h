@@ -10,6 +10,7 @@
 
 #include "platform/ipc_connection.h"
 #include "platform/ipc_endpoint.h"
+#include "platform/log.h"
 
 namespace typhora {
 
@@ -61,6 +62,8 @@ class TyphoraHandler final : public IpcExportedObject,
   // The connection as the daemon's status shows it (ipc/handler_status.cc): peer, signing
   // identifier, capabilities, whether it checked in, its web-content connections.
   Value statusRecord() const;
+  // The peer its log lines are about: pid, and signing identifier once checked in.
+  LogPeer logPeer() const;
 
  private:
   void observeFontChanges();
