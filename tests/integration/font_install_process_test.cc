@@ -67,6 +67,7 @@ TEST_F(FontInstallProcessTest, ACheckedInClientHearsOfInstalledRemovedAndDisable
   ASSERT_EQ(removed.status, 0) << removed.all;
   EXPECT_FALSE(fs::exists(root_ / kInstalled.substr(1) / "DejaVuSerif-Bold.ttf"));
   EXPECT_EQ(client->waitFor(20s), 0) << client->output();
+  client->finishOutput();
   EXPECT_EQ(client->countLines(R"("removed")"), 2u) << client->output();
 
   // The daemon itself serves what was installed and enabled again, from the rewritten file.
