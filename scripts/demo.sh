@@ -79,6 +79,19 @@ typhora demo
 
 From another terminal, paste these:
 
+  # 0. typhoractl on the path, pointed at this demo's device root and sockets.
+  export PATH="$top/build/debug/tools:\$PATH" TYPHORA_ROOT=$root TYPHORA_RUNTIME_DIR=$run
+
+  # A browser that checked in and prints every font change it is told of (leave it running).
+  $apps/browser client --watch &
+  # Install fonts by file as a font provider would: the browser prints the change.
+  typhoractl font install --provider com.example.fonts /usr/share/fonts/truetype/dejavu/*.ttf
+  typhoractl font list --provider com.example.fonts
+  # The reader asks for a family that just arrived; the ledger then shows what it was given.
+  $apps/reader request-fonts --family "DejaVu Sans Mono" >/dev/null
+  typhoractl grants --table
+  typhoractl status --table            # or plain JSON, or --metrics for a scraper
+
   # 1. An installed, enabled family: answered at once (the fonts, with a token for each file).
   $apps/reader --runtime-dir $run request-fonts --family "DejaVu Sans"
 

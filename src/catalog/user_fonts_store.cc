@@ -49,6 +49,17 @@ void TyphoraDaemon::invalidateUserFonts() {
   userFontsInfo_ = Value();
   userFontsNameIndex_.reset();
   enabledUserFontsInfo_ = Value();
+  ++userFontsGeneration_;
+}
+
+std::uint64_t TyphoraDaemon::userFontsGeneration() {
+  std::lock_guard lock(userFontsInfoMutex_);
+  return userFontsGeneration_;
+}
+
+bool TyphoraDaemon::isUserFontsInfoCached() {
+  std::lock_guard lock(userFontsInfoMutex_);
+  return !userFontsInfo_.isNull();
 }
 
 std::shared_ptr<const UserFontsNameIndex> TyphoraDaemon::userFontsNameIndex() {

@@ -13,6 +13,7 @@
 
 #include "daemon/typhora_daemon.h"
 #include "platform/linux/files/device_root.h"
+#include "platform/linux/events/event_socket_protocol.h"
 #include "platform/linux/heap_reserve.h"
 #include "platform/linux/linux_platform.h"
 #include "platform/linux/lumo/lumo_connection.h"
@@ -23,15 +24,18 @@ namespace {
 constexpr const char* kUsage =
     "usage: typhorad [--root DIR] [--runtime-dir DIR] [--log-level debug|info|error]\n"
     "                [--log-target stderr|journal]\n"
+    "       typhorad --version\n"
     "\n"
-    "  --root DIR         device root under which every path of the daemon lives (default /)\n"
+    "  --root DIR         device root under which every path of the daemon lives\n"
+    "                     (default " TYPHORA_DEFAULT_ROOT
+    ")\n"
     "  --runtime-dir DIR  where the service socket is made (default $RUNTIME_DIRECTORY,\n"
     "                     else /run/typhora); ignored under systemd socket activation\n"
     "  --log-level L      lowest level logged (default info)\n"
     "  --log-target T     stderr, or the journal (default: journal when started by systemd)\n";
 
 struct Options {
-  std::string root = "/";
+  std::string root = TYPHORA_DEFAULT_ROOT;
   std::string runtimeDir;
   typhora::LogLevel level = typhora::LogLevel::Info;
   std::string target;
@@ -64,6 +68,9 @@ Options parseOptions(int argc, char** argv) {
     };
     if (arg == "--help" || arg == "-h") {
       std::fputs(kUsage, stdout);
+      std::exit(0);
+    } else if (arg == "--version") {
+      std::puts("typhorad " TYPHORA_VERSION);
       std::exit(0);
     } else if (arg == "--root") {
       options.root = next();
@@ -125,6 +132,11 @@ int main(int argc, char** argv) {
   static typhora::LinuxPlatform platform(options.root, options.runtimeDir);
   typhora::TyphoraDaemon::installPlatform(platform.bundle());
   typhora::TyphoraDaemon& daemon = typhora::TyphoraDaemon::sharedDaemon();
+  platform.setReporter([&daemon](const std::string& operation, const typhora::Value& argument) {
+    if (operation == typhora::eventop::kStatusReport) return daemon.statusReport();
+    const std::string* identifier = argument.asString();
+    return daemon.grantsReport(identifier != nullptr ? std::optional(*identifier) : std::nullopt);
+  });
   // The event socket opens after the service socket, which so keeps a lone unnamed activated
   // socket. An event that started the daemon waits in the socket's backlog until then, and in its
   // launch event stream until the daemon's handler is installed.

@@ -2,6 +2,8 @@
 // start-up order; each subsystem's operations are defined in that subsystem's folder.
 #pragma once
 
+#include <atomic>
+#include <chrono>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -88,6 +90,17 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   // IPC: the registry reports changed fonts; every checked-in client is told what it may see.
   void fontChanged(const Value& change, const IpcReply& reply);
   LocalNotificationCenter& localNotificationCenter() { return localNotificationCenter_; }
+  // The handlers of the connections still open.
+  std::vector<std::shared_ptr<TyphoraHandler>> liveHandlers();
+
+  // --- Introspection for the platform's operators (daemon/status_report.cc) ---
+  // Built from the calling thread without waiting for any queue, so a busy daemon still answers.
+
+  // Uptime, connections, the request gate, the cache, pending deletions, the block list and the
+  // depth of each queue.
+  Value statusReport();
+  // The issued-fonts ledger with its paths expanded: every application, or only `identifier`.
+  Value grantsReport(const std::optional<std::string>& identifier);
 
   // --- Font catalog: the user-fonts information (catalog/user_fonts_store.cc) ---
 
@@ -98,6 +111,9 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   void setUserFontsInfo(Value info);
   // Drops the cache; the next reader loads the file again.
   void invalidateUserFonts();
+  // How many times the cache was dropped.
+  std::uint64_t userFontsGeneration();
+  bool isUserFontsInfoCached();
   // Reads the user-fonts file on the update queue: the dictionary, or null.
   Value _userFontsInfoFromDisk();
   // The daemon's path of the user-fonts file.
@@ -294,6 +310,12 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   // Derived from userFontsInfo_ when first asked for; null whenever the cache is.
   std::shared_ptr<const UserFontsNameIndex> userFontsNameIndex_;
   Value enabledUserFontsInfo_;
+  std::uint64_t userFontsGeneration_ = 0;  // cache drops so far, for status reports
+
+  // The handlers of accepted connections, pruned as their connections end.
+  std::mutex handlersMutex_;
+  std::vector<std::weak_ptr<TyphoraHandler>> handlers_;
+  const std::chrono::steady_clock::time_point startedAt_ = std::chrono::steady_clock::now();
 
   // Only keeps the service listener open for the life of the process; nothing reads it.
   std::shared_ptr<IpcListener> listener_;

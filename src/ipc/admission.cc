@@ -29,8 +29,26 @@ bool TyphoraDaemon::shouldAcceptNewConnection(IpcListener& /*listener*/,
   // The closure owns the handler; clearing clientConnection breaks the connection-handler cycle.
   connection->setInvalidationHandler([handler] { handler->setClientConnection(nullptr); });
   handler->setClientConnection(connection);
+  {
+    std::lock_guard lock(handlersMutex_);
+    std::erase_if(handlers_, [](const auto& weak) {
+      auto tracked = weak.lock();
+      return !tracked || !tracked->clientConnection();
+    });
+    handlers_.push_back(handler);
+  }
   connection->resume();
   return true;
+}
+
+std::vector<std::shared_ptr<TyphoraHandler>> TyphoraDaemon::liveHandlers() {
+  std::vector<std::shared_ptr<TyphoraHandler>> live;
+  std::lock_guard lock(handlersMutex_);
+  for (const auto& weak : handlers_) {
+    auto handler = weak.lock();
+    if (handler && handler->clientConnection()) live.push_back(std::move(handler));
+  }
+  return live;
 }
 
 bool TyphoraDaemon::forwardInvocation(const IpcOperation& operation,

@@ -24,6 +24,7 @@ TyphoraHandler::~TyphoraHandler() {
 
 bool TyphoraHandler::invoke(const IpcOperation& operation, const std::vector<Value>& arguments,
                             IpcReply reply) {
+  const LogPeerScope peer(logPeer());
   const std::string& name = operation.wireName;
   if (name == op::kSendFonts) {
     // Accepted and deliberately never answered.
@@ -56,6 +57,8 @@ void TyphoraHandler::checkin(const IpcReply& reply) {
     hasEnumerationEntitlement_ = enumeration;
     hasFontAccessEntitlement_ = fontAccess;
     isFontProvider_ = provider;
+    checkedIn_ = true;
+    signingIdentifier_ = identifier;
   }
   if (isProcessIdentifierToIgnore(identifier ? &*identifier : nullptr)) {
     reply({Value()});
@@ -92,6 +95,12 @@ void TyphoraHandler::checkinForFontPicker(const IpcReply& reply) {
       checkin.emplace_back("extension.fontasset", extension);
     reply({Value(Dictionary(std::move(checkin)))});
   });
+}
+
+LogPeer TyphoraHandler::logPeer() const {
+  std::lock_guard lock(mutex_);
+  const AuditToken peer = clientConnection_ ? clientConnection_->auditToken() : AuditToken{};
+  return {peer.pid, signingIdentifier_.value_or("")};
 }
 
 bool TyphoraHandler::isProcessIdentifierToIgnore(const std::string* identifier) {

@@ -10,6 +10,7 @@
 
 #include "platform/ipc/ipc_connection.h"
 #include "platform/ipc/ipc_endpoint.h"
+#include "platform/log/log.h"
 
 namespace typhora {
 
@@ -58,6 +59,12 @@ class TyphoraHandler final : public IpcExportedObject,
 
   std::vector<std::shared_ptr<IpcConnection>> webcontentProcessConnections() const;
 
+  // The connection as the daemon's status shows it (ipc/handler_status.cc): peer, signing
+  // identifier, capabilities, whether it checked in, its web-content connections.
+  Value statusRecord() const;
+  // The peer its log lines are about: pid, and signing identifier once checked in.
+  LogPeer logPeer() const;
+
  private:
   void observeFontChanges();
   void userFontsChanged(bool added, const ValueArray& urls);
@@ -72,6 +79,9 @@ class TyphoraHandler final : public IpcExportedObject,
   std::shared_ptr<IpcConnection> clientConnection_;
   const std::shared_ptr<TyphoraDaemon> server_;
   std::optional<std::string> processIdentifier_;
+  // Set by checkin: whether it ran, and the signing identifier it found.
+  bool checkedIn_ = false;
+  std::optional<std::string> signingIdentifier_;
   std::optional<std::vector<std::shared_ptr<IpcConnection>>> webcontentProcessConnections_;
 };
 

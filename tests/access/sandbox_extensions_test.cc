@@ -81,6 +81,8 @@ TEST_F(CheckinTest, NoCapabilityIsAnsweredAbsentWithoutEnteringTheQueue) {
   ASSERT_EQ(answered.wait_for(std::chrono::seconds(10)), std::future_status::ready);
   EXPECT_TRUE(answered.get().isNull());
   release.signal();
+  // The job still waking from the semaphore must be done before the semaphore goes.
+  daemon_->mainHandlerQueue().sync([] {});
 }
 
 TEST_F(CheckinTest, EnumerationGetsEveryEnabledCachedRecordAndDirectoryTokens) {

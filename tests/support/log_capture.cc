@@ -6,7 +6,9 @@ class LogCapture::Sink final : public LogSink {
  public:
   void write(LogLevel level, const LogCategory* category, std::string_view message) override {
     std::lock_guard lock(mutex);
-    lines.push_back({level, category ? category->category : "system", std::string(message)});
+    const LogPeer* peer = currentLogPeer();
+    lines.push_back({level, category ? category->category : "system", std::string(message),
+                     peer ? peer->pid : 0, peer ? peer->identifier : std::string()});
   }
   mutable std::mutex mutex;
   std::vector<LogLine> lines;

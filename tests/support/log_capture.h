@@ -15,6 +15,8 @@ struct LogLine {
   LogLevel level;
   std::string category;  // "system" for the plain system log
   std::string message;
+  std::int64_t peerPid = 0;  // the thread's log peer when the line was written, if any
+  std::string peerIdentifier;
 };
 
 class LogCapture {

@@ -27,7 +27,8 @@ constexpr const char* kActivityUsage =
     "\n"
     "Runs one of the daemon's registered background activities now.\n";
 
-// A connection to the event socket; `exported` serves what the socket sends back.
+}  // namespace
+
 std::shared_ptr<IpcConnection> connectToEvents(LumoService& service,
                                                std::shared_ptr<IpcExportedObject> exported) {
   auto connection = service.connectToService(kEventSocketName);
@@ -40,7 +41,6 @@ std::shared_ptr<IpcConnection> connectToEvents(LumoService& service,
   return connection;
 }
 
-// Calls `wireName` and waits for the reply; nullopt (with a message printed) when it failed.
 std::optional<std::vector<Value>> callEvents(IpcConnection& connection, const std::string& wireName,
                                              std::vector<Value> arguments) {
   std::optional<std::vector<Value>> reply;
@@ -51,6 +51,8 @@ std::optional<std::vector<Value>> callEvents(IpcConnection& connection, const st
   if (!reply) std::cerr << "typhoractl: " << (error.empty() ? "no reply" : error) << "\n";
   return reply;
 }
+
+namespace {
 
 int post(const ClientOptions& options, const std::vector<std::string>& args) {
   const bool distributed = args.size() >= 2 && args[0] == "--distributed" && args.size() <= 3;

@@ -9,11 +9,13 @@
 #include "app_state_command.h"
 #include "client_command.h"
 #include "event_command.h"
-#include "load_command.h"
+#include "font_command.h"
 #include "font_names_command.h"
 #include "font_picker_command.h"
+#include "load_command.h"
 #include "plist_command.h"
 #include "request_fonts_command.h"
+#include "status_command.h"
 #include "view_service_command.h"
 #include "web_content_command.h"
 
@@ -37,10 +39,16 @@ constexpr const char* kUsage =
     "  picker-client         an application that starts the font picker with its endpoint\n"
     "  pick NAME             the font picker delivering NAME's family to its client\n"
     "  font-names FILE       a font file's PostScript and family names, as JSON\n"
+    "  font install|remove|enable|disable|list   the font registry under the device root\n"
+    "  client [--watch]      check in as an application; --watch prints font changes\n"
+    "  status [--table|--metrics]   the daemon's state (event socket: root or its user)\n"
+    "  grants [APP] [--table]       the fonts issued to each application\n"
     "\n"
     "  --runtime-dir DIR     where the daemon's socket is (default $TYPHORA_RUNTIME_DIR,\n"
     "                        else /run/typhora)\n"
-    "  --root DIR            the device root (default $TYPHORA_ROOT, else /)\n"
+    "  --root DIR            the device root (default $TYPHORA_ROOT, else " TYPHORA_DEFAULT_ROOT
+    ")\n"
+    "  --version             print the version\n"
     "Each command takes --help.\n";
 
 }  // namespace
@@ -52,11 +60,15 @@ int main(int argc, char** argv) {
   const char* fromEnv = std::getenv("TYPHORA_RUNTIME_DIR");
   options.runtimeDir = fromEnv != nullptr ? fromEnv : "/run/typhora";
   const char* rootFromEnv = std::getenv("TYPHORA_ROOT");
-  std::string root = rootFromEnv != nullptr ? rootFromEnv : "/";
+  std::string root = rootFromEnv != nullptr ? rootFromEnv : TYPHORA_DEFAULT_ROOT;
 
   while (!args.empty() && args[0].starts_with("--")) {
     if (args[0] == "--help" || args[0] == "-h") {
       std::cout << kUsage;
+      return 0;
+    }
+    if (args[0] == "--version") {
+      std::cout << "typhoractl " TYPHORA_VERSION "\n";
       return 0;
     }
     if (args[0] == "--runtime-dir" && args.size() >= 2) {
@@ -92,6 +104,9 @@ int main(int argc, char** argv) {
   if (args[0] == "picker-client") return typhora::ctl::runPickerClientCommand(options, rest);
   if (args[0] == "pick") return typhora::ctl::runPickCommand(options, rest);
   if (args[0] == "font-names") return typhora::ctl::runFontNamesCommand(rest);
+  if (args[0] == "font") return typhora::ctl::runFontCommand(options, root, rest);
+  if (args[0] == "status") return typhora::ctl::runStatusCommand(options, rest);
+  if (args[0] == "grants") return typhora::ctl::runGrantsCommand(options, rest);
   if (args[0] == "activity")
     return typhora::ctl::runActivityCommand(options, {args.begin() + 1, args.end()});
   return typhora::ctl::runClientCommand(options, args);

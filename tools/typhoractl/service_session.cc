@@ -4,15 +4,21 @@
 #include <iostream>
 
 #include "daemon/typhora_daemon.h"
-#include "platform/linux/lumo/lumo_connection.h"
+#include "ipc/interface_descriptions.h"
 #include "platform/value/json_codec.h"
+#include "platform/linux/lumo/lumo_connection.h"
 
 namespace typhora::ctl {
 
 ServiceSession::ServiceSession(const ClientOptions& options,
-                               std::shared_ptr<const IpcInterface> remote)
+                               std::shared_ptr<const IpcInterface> remote,
+                               std::shared_ptr<IpcExportedObject> exported)
     : options_(options), remote_(std::move(remote)), service_(options.runtimeDir) {
   connection_ = service_.connectToService(kServiceName);
+  if (exported) {
+    connection_->setExportedInterface(typhoraClientProtocol());
+    connection_->setExportedObject(std::move(exported));
+  }
   connection_->setRemoteInterface(remote_);
   connection_->resume();
 }

@@ -20,7 +20,10 @@ struct CallResult {
 
 class ServiceSession {
  public:
-  ServiceSession(const ClientOptions& options, std::shared_ptr<const IpcInterface> remote);
+  // With `exported`, the session offers the client's interface to the daemon on the connection,
+  // answered by `exported`.
+  ServiceSession(const ClientOptions& options, std::shared_ptr<const IpcInterface> remote,
+                 std::shared_ptr<IpcExportedObject> exported = nullptr);
   ~ServiceSession();
   ServiceSession(const ServiceSession&) = delete;
   ServiceSession& operator=(const ServiceSession&) = delete;

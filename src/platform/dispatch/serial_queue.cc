@@ -225,6 +225,11 @@ const std::string& SerialQueue::label() const {
   return state_->label;
 }
 
+std::size_t SerialQueue::pendingJobs() const {
+  std::lock_guard lock(state_->mutex);
+  return state_->jobs.size();
+}
+
 void SerialQueue::async(Job job) {
   enqueue(state_, std::move(job));
 }

@@ -32,6 +32,8 @@ class SerialQueue : public std::enable_shared_from_this<SerialQueue> {
   SerialQueue& operator=(const SerialQueue&) = delete;
 
   const std::string& label() const;
+  // Jobs queued and not yet started (delayed jobs count once their delay has passed).
+  std::size_t pendingJobs() const;
 
   void async(Job job);
   // Runs `job` on this queue and waits for it. From a job already running on this queue (also

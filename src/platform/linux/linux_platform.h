@@ -33,6 +33,10 @@ class LinuxPlatform {
   Platform& bundle() { return bundle_; }
   // Opens the platform's own sockets (the event socket); false when one cannot be opened.
   bool startServices();
+  // What the event socket's introspection operations answer.
+  void setReporter(LinuxEventHub::Reporter reporter) {
+    eventHub_->setReporter(std::move(reporter));
+  }
 
  private:
   LumoService ipc_;

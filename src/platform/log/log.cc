@@ -74,9 +74,21 @@ class JournalSink final : public LogSink {
                    : level == LogLevel::Debug ? LOG_DEBUG
                                               : LOG_INFO;
     std::string text(message);
-    sd_journal_send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", priority,
-                    "SYSLOG_IDENTIFIER=typhorad", "TYPHORA_CATEGORY=%s",
-                    category != nullptr ? category->category : "system", nullptr);
+    const char* categoryName = category != nullptr ? category->category : "system";
+    const LogPeer* peer = currentLogPeer();
+    if (peer == nullptr) {
+      sd_journal_send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", priority,
+                      "SYSLOG_IDENTIFIER=typhorad", "TYPHORA_CATEGORY=%s", categoryName, nullptr);
+    } else if (peer->identifier.empty()) {
+      sd_journal_send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", priority,
+                      "SYSLOG_IDENTIFIER=typhorad", "TYPHORA_CATEGORY=%s", categoryName,
+                      "TYPHORA_PEER_PID=%lld", static_cast<long long>(peer->pid), nullptr);
+    } else {
+      sd_journal_send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", priority,
+                      "SYSLOG_IDENTIFIER=typhorad", "TYPHORA_CATEGORY=%s", categoryName,
+                      "TYPHORA_PEER_PID=%lld", static_cast<long long>(peer->pid),
+                      "TYPHORA_PEER_IDENTIFIER=%s", peer->identifier.c_str(), nullptr);
+    }
   }
 };
 
@@ -220,6 +232,22 @@ std::shared_ptr<LogSink> makeStderrLogSink() {
 }
 std::shared_ptr<LogSink> makeJournalLogSink() {
   return std::make_shared<JournalSink>();
+}
+
+namespace {
+thread_local const LogPeer* threadLogPeer = nullptr;
+}  // namespace
+
+LogPeerScope::LogPeerScope(LogPeer peer) : previous_(threadLogPeer), peer_(std::move(peer)) {
+  threadLogPeer = &peer_;
+}
+
+LogPeerScope::~LogPeerScope() {
+  threadLogPeer = previous_;
+}
+
+const LogPeer* currentLogPeer() {
+  return threadLogPeer;
 }
 
 void logWrite(LogLevel level, const LogCategory* category, std::string_view format,

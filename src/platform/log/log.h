@@ -28,6 +28,26 @@ struct LogCategory {
 // The daemon's one category.
 inline constexpr LogCategory kTYLogTyphoraDaemon{"com.zorvane.typhorad", "daemon"};
 
+// The peer that the calling thread's log lines are about: set by a scope around the handling of a
+// peer's call. The journal sink records it in TYPHORA_PEER_PID and TYPHORA_PEER_IDENTIFIER.
+struct LogPeer {
+  std::int64_t pid = 0;
+  std::string identifier;  // its signing identifier; empty when it has none
+};
+class LogPeerScope {
+ public:
+  explicit LogPeerScope(LogPeer peer);
+  ~LogPeerScope();
+  LogPeerScope(const LogPeerScope&) = delete;
+  LogPeerScope& operator=(const LogPeerScope&) = delete;
+
+ private:
+  const LogPeer* previous_;
+  LogPeer peer_;
+};
+// The innermost open scope's peer on this thread, or null.
+const LogPeer* currentLogPeer();
+
 // Where formatted lines go. `category` is nullptr for the plain system log.
 class LogSink {
  public:

@@ -239,6 +239,31 @@ TEST(SystemClockTimer, NeverFiresBeforeItsDeadline) {
   EXPECT_GE(firedAfter, 30ms);
 }
 
+// Lines written while a peer's call is handled name that peer; nested scopes restore the outer
+// peer, and other threads never see it.
+TEST(Log, LinesCarryThePeerOfTheirThread) {
+  testing::LogCapture log;
+  {
+    LogPeerScope outer({41, "com.example.reader"});
+    {
+      LogPeerScope inner({42, ""});
+      TYLog(kTYLogTyphoraDaemon, "inner");
+    }
+    TYLog(kTYLogTyphoraDaemon, "outer");
+    std::thread([] { TYLog(kTYLogTyphoraDaemon, "elsewhere"); }).join();
+  }
+  TYLog(kTYLogTyphoraDaemon, "none");
+  auto lines = log.lines();
+  ASSERT_EQ(lines.size(), 4u);
+  EXPECT_EQ(lines[0].peerPid, 42);
+  EXPECT_EQ(lines[0].peerIdentifier, "");
+  EXPECT_EQ(lines[1].peerPid, 41);
+  EXPECT_EQ(lines[1].peerIdentifier, "com.example.reader");
+  EXPECT_EQ(lines[2].peerPid, 0);
+  EXPECT_EQ(lines[3].peerPid, 0);
+  EXPECT_EQ(currentLogPeer(), nullptr);
+}
+
 TEST(Log, FormatsConversionsAndFiltersLevels) {
   EXPECT_EQ(formatLog("error reading %@", {std::string("/var/x")}), "error reading /var/x");
   EXPECT_EQ(formatLog("%s %d %u %ld %zu %%", {"a", -3, 7u, 9L, std::size_t{2}}), "a -3 7 9 2 %");

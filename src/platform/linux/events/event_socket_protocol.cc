@@ -19,6 +19,8 @@ std::shared_ptr<const IpcInterface> eventSocketProtocol() {
           {eventop::kPostSystemNotification, {{Kind::String, false}}, true, {}},
           {eventop::kWatchNotifications, {}, true, {}},
           {eventop::kRunActivity, {{Kind::String, false}}, true, {{Kind::Bool, false}}},
+          {eventop::kStatusReport, {}, true, {{Kind::Dictionary, false}}},
+          {eventop::kGrantsReport, {{Kind::String, true}}, true, {{Kind::Dictionary, false}}},
       });
   return description;
 }

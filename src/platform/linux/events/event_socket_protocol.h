@@ -16,6 +16,10 @@ inline constexpr const char* kPostDistributedNotification = "postDistributedNoti
 inline constexpr const char* kPostSystemNotification = "postSystemNotification:";
 inline constexpr const char* kWatchNotifications = "watchNotifications";
 inline constexpr const char* kRunActivity = "runActivity:";
+// Introspection: the daemon's status, and the fonts issued to applications (one, or all when
+// the argument is absent).
+inline constexpr const char* kStatusReport = "statusReport";
+inline constexpr const char* kGrantsReport = "grantsReport:";
 // To a watcher: name, "distributed" or "system", user info or absent.
 inline constexpr const char* kNotificationPosted = "notificationPosted:kind:userInfo:";
 }  // namespace eventop

@@ -26,6 +26,9 @@ bool EventSocketSession::invoke(const IpcOperation& operation, const std::vector
   } else if (name == eventop::kRunActivity) {
     reply({Value(hub->runActivity(*arguments[0].asString()))});
     return true;
+  } else if (name == eventop::kStatusReport || name == eventop::kGrantsReport) {
+    reply({hub->report(name, arguments.empty() ? Value() : arguments[0])});
+    return true;
   } else {
     return false;
   }

@@ -80,6 +80,20 @@ bool LinuxEventHub::runActivity(const std::string& identifier) {
   return runner && runner(identifier);
 }
 
+void LinuxEventHub::setReporter(Reporter reporter) {
+  std::lock_guard lock(mutex_);
+  reporter_ = std::move(reporter);
+}
+
+Value LinuxEventHub::report(const std::string& operation, const Value& argument) {
+  Reporter reporter;
+  {
+    std::lock_guard lock(mutex_);
+    reporter = reporter_;
+  }
+  return reporter ? reporter(operation, argument) : Value(Dictionary());
+}
+
 void LinuxEventHub::addWatcher(std::shared_ptr<IpcConnection> connection) {
   std::lock_guard lock(mutex_);
   watchers_.push_back(std::move(connection));

@@ -20,6 +20,8 @@ class LinuxEventHub final : public IpcListenerDelegate,
                             public std::enable_shared_from_this<LinuxEventHub> {
  public:
   using ActivityRunner = std::function<bool(const std::string& identifier)>;
+  // Answers an introspection operation of the event socket (its wire name) with a dictionary.
+  using Reporter = std::function<Value(const std::string& operation, const Value& argument)>;
 
   LinuxEventHub(LumoService& ipc, LinuxLaunchEventStream& streams) : ipc_(ipc), streams_(streams) {}
 
@@ -29,6 +31,9 @@ class LinuxEventHub final : public IpcListenerDelegate,
   void setActivityRunner(ActivityRunner runner);
   bool runActivity(const std::string& identifier);
   void addWatcher(std::shared_ptr<IpcConnection> connection);
+  void setReporter(Reporter reporter);
+  // An empty dictionary until a reporter is set.
+  Value report(const std::string& operation, const Value& argument);
 
   bool shouldAcceptNewConnection(IpcListener& listener,
                                  std::shared_ptr<IpcConnection> connection) override;
@@ -38,9 +43,10 @@ class LinuxEventHub final : public IpcListenerDelegate,
   LinuxLaunchEventStream& streams_;
   std::shared_ptr<IpcListener> listener_;
   std::mutex postMutex_;  // held across one whole post
-  std::mutex mutex_;      // watchers_ and activityRunner_
+  std::mutex mutex_;      // watchers_, activityRunner_ and reporter_
   std::vector<std::weak_ptr<IpcConnection>> watchers_;
   ActivityRunner activityRunner_;
+  Reporter reporter_;
 };
 
 }  // namespace typhora

@@ -6,13 +6,13 @@
 #include <map>
 #include <set>
 
-#include "platform/fd/regular_file.h"
+#include "platform/value/cbor_codec.h"
 #include "platform/linux/files/atomic_file.h"
 #include "platform/linux/files/device_root.h"
 #include "platform/linux/fonts/font_face_names.h"
 #include "platform/log/log.h"
-#include "platform/value/cbor_codec.h"
 #include "platform/value/plist_reader.h"
+#include "platform/fd/regular_file.h"
 
 namespace typhora {
 
@@ -174,6 +174,86 @@ void LinuxUserFontManager::synchronizeFontAssets(std::function<void(bool success
     success = mirrorAssetsLocked();
   }
   completion(success);
+}
+
+std::optional<std::vector<std::string>> LinuxUserFontManager::installFontFiles(
+    const std::string& provider, const std::vector<std::string>& machinePaths, std::string* error) {
+  std::optional<std::string> directory = directoryNameFromIdentifier(provider);
+  if (!directory) {
+    *error = "'" + provider + "' cannot name a provider's directory";
+    return std::nullopt;
+  }
+  struct Checked {
+    std::string path;  // in the registry
+    std::vector<std::uint8_t> bytes;
+    Value names;
+  };
+  std::vector<Checked> checked;
+  std::set<std::string> seen;
+  for (const std::string& source : machinePaths) {
+    const std::string name = fs::path(source).filename().string();
+    const std::string path = kFontFiles + *directory + "/" + name;
+    if (!DeviceRoot::isSingleComponent(name) || !seen.insert(path).second) {
+      *error = source + ": " + (name.empty() ? "names no file" : "is named twice");
+      return std::nullopt;
+    }
+    std::string why;
+    std::optional<std::vector<std::uint8_t>> bytes =
+        RegularFile::read(source, FontFaceNames::kMaxFontBytes, &why);
+    std::optional<Value> names = bytes ? FontFaceNames::fromBytes(*bytes, &why) : std::nullopt;
+    if (!names) {
+      *error = source + ": " + why;
+      return std::nullopt;
+    }
+    checked.push_back({path, std::move(*bytes), std::move(*names)});
+  }
+
+  std::lock_guard lock(mutex_);
+  std::vector<std::string> written;
+  auto undo = [&] {
+    std::string ignored;
+    for (const std::string& path : written) files_.removeItem(path, &ignored);
+  };
+  for (const Checked& font : checked) {
+    if (!AtomicFile::write(root_.onDisk(font.path), font.bytes, 0644, error)) {
+      undo();
+      return std::nullopt;
+    }
+    written.push_back(font.path);
+  }
+  std::map<std::string, Value> records;
+  for (auto& [path, record] : entriesOf(userFontsInfo())) records.emplace(path, record);
+  for (const Checked& font : checked)
+    records.insert_or_assign(font.path,
+                             Value::dictionary({{"disabled", false}, {"familyName", font.names}}));
+  if (!writeInfoLocked(Value(Dictionary({records.begin(), records.end()})), error)) {
+    undo();
+    return std::nullopt;
+  }
+  return written;
+}
+
+bool LinuxUserFontManager::removeFontFiles(const std::vector<std::string>& paths,
+                                           std::string* error) {
+  std::lock_guard lock(mutex_);
+  std::vector<DictionaryEntry> entries = entriesOf(userFontsInfo());
+  const std::set<std::string> removed(paths.begin(), paths.end());
+  for (const std::string& path : removed) {
+    if (std::none_of(entries.begin(), entries.end(),
+                     [&](const auto& entry) { return entry.first == path; })) {
+      *error = path + ": the registry has no such font";
+      return false;
+    }
+  }
+  std::erase_if(entries, [&](const auto& entry) { return removed.contains(entry.first); });
+  if (!writeInfoLocked(Value(Dictionary(std::move(entries))), error)) return false;
+  // The records are gone: a file that cannot be deleted now is only left over, never served.
+  for (const std::string& path : removed) {
+    std::string why;
+    if (files_.fileExists(path) && !files_.removeItem(path, &why))
+      TYLog_Error(kTYLogTyphoraDaemon, "font registry: cannot delete %@: %@", path, why);
+  }
+  return true;
 }
 
 bool LinuxUserFontManager::mirrorAssetsLocked() {

@@ -44,6 +44,17 @@ class LinuxUserFontManager final : public TYUserFontManager {
   // Synchronous: the completion has run when this returns.
   void synchronizeFontAssets(std::function<void(bool success)> completion) override;
 
+  // Copies font files (machine paths) into the provider's directory and records their faces,
+  // enabled, as a font provider's installation does. Every file is read and checked before any
+  // is copied: when one is not a complete font, none is installed. Answers the registry paths
+  // recorded, in the order given; nullopt with `error` set otherwise.
+  std::optional<std::vector<std::string>> installFontFiles(
+      const std::string& provider, const std::vector<std::string>& machinePaths,
+      std::string* error);
+  // Forgets the records of registry paths and deletes their files; a path the registry does not
+  // know refuses them all. The paths' directories stay.
+  bool removeFontFiles(const std::vector<std::string>& paths, std::string* error);
+
  private:
   Value readInfo(const char* path) const;
   bool writeInfoLocked(const Value& info, std::string* error);

@@ -19,8 +19,10 @@
 namespace typhora {
 namespace {
 
+// A daemon running as its own user may not signal a peer of another user: EPERM still says the
+// process is there; only ESRCH says it has ended.
 bool alive(int pidfd) {
-  return syscall(SYS_pidfd_send_signal, pidfd, 0, nullptr, 0) == 0;
+  return syscall(SYS_pidfd_send_signal, pidfd, 0, nullptr, 0) == 0 || errno == EPERM;
 }
 
 }  // namespace
