@@ -3,6 +3,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <fstream>
 #include <iostream>
 #include <sstream>
 
@@ -18,6 +19,24 @@ const std::string kTorture = std::string(TYPHORA_BINARY_DIR) + "/tools/typhora-t
 
 class TortureTest : public DaemonTestBase {
  protected:
+  // An entitled application asking in the foreground for a family nobody has, with a dialog
+  // that takes a while to answer: the command the torture kills with the gate and dialog up.
+  std::string foregroundRequester() {
+    const std::string reader = installApp("reader", "com.example.reader",
+                                          R"({"com.zorvane.developer.user-fonts": ["app-usage"]})");
+    fs::create_directories(root_ / "etc/typhora/view-services");
+    std::ofstream(root_ / "etc/typhora/view-services/com.zorvane.FontInstallViewService.plist")
+        << R"({"Program": "/bin/sh", "Arguments": ["-c", "sleep 0.2; exec )" << kCtl
+        << R"( view-service \"$@\"", "view-service"]})";
+    const fs::path wrapper = dir_ / "foreground";
+    std::ofstream(wrapper) << "#!/bin/sh\n"
+                           << kCtl << " --root " << root_.string()
+                           << " app-state set $$ 8 >/dev/null && exec \"$@\"\n";
+    fs::permissions(wrapper, fs::perms::owner_all);
+    return wrapper.string() + " " + reader + " --runtime-dir " + runtime_.string() +
+           " request-fonts --family";
+  }
+
   std::vector<std::string> torture(std::vector<std::string> extra) const {
     std::vector<std::string> argv = {kTorture, "--runtime-dir", runtime_.string(), "--json"};
     argv.insert(argv.end(), extra.begin(), extra.end());
@@ -26,8 +45,10 @@ class TortureTest : public DaemonTestBase {
 };
 
 TEST_F(TortureTest, EveryAttackLeavesTheDaemonServingAndRefusesEveryBorrowedIdentity) {
+  const std::string requester = foregroundRequester();
   startDaemon();
-  auto run = runCommand(torture({"--seconds", "2", "--storm", "300"}), 180s);
+  auto run = runCommand(
+      torture({"--seconds", "2", "--storm", "300", "--requester", requester + " Missing"}), 180s);
   std::cout << "[figures]\n" << run.out;
   EXPECT_EQ(run.status, 0) << run.all << daemon_->output();
   std::istringstream rows(run.out);
@@ -40,6 +61,13 @@ TEST_F(TortureTest, EveryAttackLeavesTheDaemonServingAndRefusesEveryBorrowedIden
     EXPECT_THAT(row, Not(HasSubstr(R"("tries":0,)")));
   }
   EXPECT_EQ(count, 8) << run.out;
+  EXPECT_THAT(run.out, HasSubstr("requesters with the gate or dialog up"));
+  // Requesters killed with the gate held left it free for the next one.
+  std::istringstream words(requester + " A");
+  std::vector<std::string> argv;
+  for (std::string w; words >> w;) argv.push_back(w);
+  auto after = runCommand(argv, 30s);
+  EXPECT_EQ(after.status, 0) << after.all << daemon_->output();
   EXPECT_EQ(daemon_->waitFor(0ms), -1) << daemon_->output();
   // What a hostile peer reaches is logged once per peer, not once per message.
   EXPECT_LT(daemon_->countLines("holds too many connections"), 5u) << daemon_->output();

@@ -291,14 +291,11 @@ AttackOutcome slowReader(const AttackContext& c) {
 }
 
 // Starts this program as `--child MODE SOCKET ARG`; its pid, or -1.
+pid_t spawn(const std::vector<std::string>& args);
+
+// Starts this program as `--child MODE SOCKET ARG`; its pid, or -1.
 pid_t spawnChild(const AttackContext& c, const std::string& mode, const std::string& arg) {
-  std::vector<std::string> args = {c.self, "--child", mode, c.socket, arg};
-  std::vector<char*> argv;
-  for (auto& a : args) argv.push_back(a.data());
-  argv.push_back(nullptr);
-  pid_t pid = -1;
-  if (posix_spawn(&pid, c.self.c_str(), nullptr, nullptr, argv.data(), environ) != 0) return -1;
-  return pid;
+  return spawn({c.self, "--child", mode, c.socket, arg});
 }
 
 int exitStatus(pid_t pid) {
@@ -307,19 +304,40 @@ int exitStatus(pid_t pid) {
   return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
+// Starts `argv`; its pid, or -1.
+pid_t spawn(const std::vector<std::string>& args) {
+  std::vector<std::string> copy = args;
+  std::vector<char*> argv;
+  for (auto& a : copy) argv.push_back(a.data());
+  argv.push_back(nullptr);
+  pid_t pid = -1;
+  if (posix_spawn(&pid, argv[0], nullptr, nullptr, argv.data(), environ) != 0) return -1;
+  return pid;
+}
+
 AttackOutcome dyingPeers(const AttackContext& c) {
   AttackOutcome o;
   std::mt19937 rng(7);
-  constexpr int kPhases = 6;
-  for (int phase = 0; timeLeft(c); phase = (phase + 1) % kPhases) {
-    pid_t pid = spawnChild(c, "die", std::to_string(phase));
+  // The phases of a raw peer, then (when given) an application with a request in flight.
+  const int phases = c.requester.empty() ? 6 : 7;
+  long requesters = 0;
+  for (int phase = 0; timeLeft(c); phase = (phase + 1) % phases) {
+    const bool request = phase == 6;
+    pid_t pid = request ? spawn(c.requester) : spawnChild(c, "die", std::to_string(phase));
     if (pid < 0) break;
     ++o.tries;
-    std::this_thread::sleep_for(std::chrono::microseconds(rng() % 20000));
+    requesters += request ? 1 : 0;
+    // A requester gets long enough to reach the gate and the dialog.
+    const auto delay = request ? std::chrono::microseconds(rng() % 400000)
+                               : std::chrono::microseconds(rng() % 20000);
+    std::this_thread::sleep_for(delay);
     kill(pid, SIGKILL);
     exitStatus(pid);
   }
-  o.note = "killed in " + std::to_string(kPhases) + " phases, up to a request in flight";
+  o.note = "killed in 6 phases of a call";
+  if (requesters > 0) {
+    o.note += ", and " + std::to_string(requesters) + " requesters with the gate or dialog up";
+  }
   return o;
 }
 

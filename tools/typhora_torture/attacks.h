@@ -13,6 +13,9 @@ struct AttackContext {
   std::string socket;
   std::string self;  // this program, for the child processes some attacks start
   int storm = 1000;  // connections opened at once
+  // A command that asks for fonts as an entitled foreground application (so the request gate is
+  // held and the missing-fonts dialog comes up); killed at random moments. Empty: none.
+  std::vector<std::string> requester;
   std::chrono::steady_clock::time_point until;
 };
 

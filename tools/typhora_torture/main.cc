@@ -12,6 +12,7 @@
 #include <cstdio>
 #include <filesystem>
 #include <iostream>
+#include <sstream>
 #include <string>
 #include <thread>
 #include <vector>
@@ -28,7 +29,7 @@ namespace {
 
 constexpr const char* kUsage =
     "usage: typhora-torture [--runtime-dir DIR | --socket PATH] [--pid PID] [--seconds N]\n"
-    "                       [--storm N] [--only NAME,...] [--json]\n"
+    "                       [--storm N] [--only NAME,...] [--requester COMMAND] [--json]\n"
     "  --runtime-dir DIR  where the daemon's socket is (default $TYPHORA_RUNTIME_DIR, else\n"
     "                     /run/typhora)\n"
     "  --socket PATH      the service socket itself\n"
@@ -36,6 +37,8 @@ constexpr const char* kUsage =
     "  --seconds N        how long each attack runs (default 5)\n"
     "  --storm N          connections opened at once by the storm (default 1000)\n"
     "  --only NAMES       run only the attacks whose names contain one of these words\n"
+    "  --requester CMD    a command (words split on spaces) that requests a missing font as an\n"
+    "                     entitled foreground application; killed with the gate and dialog up\n"
     "  --json             one JSON object per row instead of the table\n";
 
 struct Options {
@@ -45,6 +48,7 @@ struct Options {
   int storm = 1000;
   std::vector<std::string> only;
   bool json = false;
+  std::vector<std::string> requester;
 };
 
 struct Row {
@@ -73,6 +77,9 @@ bool parse(int argc, char** argv, Options* o) {
       o->seconds = std::stod(argv[++i]);
     } else if (a == "--storm" && hasValue) {
       o->storm = std::stoi(argv[++i]);
+    } else if (a == "--requester" && hasValue) {
+      std::istringstream words(argv[++i]);
+      for (std::string w; words >> w;) o->requester.push_back(w);
     } else if (a == "--only" && hasValue) {
       std::string list = argv[++i];
       for (std::size_t at = 0; at <= list.size();) {
@@ -170,8 +177,11 @@ int main(int argc, char** argv) {
     return 2;
   }
   const DaemonGauge gauge(options.pid);
-  AttackContext context{
-      options.socket, std::filesystem::read_symlink("/proc/self/exe"), options.storm, {}};
+  AttackContext context{options.socket,
+                        std::filesystem::read_symlink("/proc/self/exe"),
+                        options.storm,
+                        options.requester,
+                        {}};
 
   ProbeClient probe(options.socket, 20ms);
   probe.start();
