@@ -253,29 +253,36 @@ AttackOutcome descriptorFlood(const AttackContext& c) {
 
 AttackOutcome slowReader(const AttackContext& c) {
   AttackOutcome o;
-  long cutOff = 0;
   constexpr int kReaders = 4;
+  constexpr std::uint64_t kBatch = 512;
+  Bytes batch;
+  for (std::uint64_t id = 1; id <= kBatch; ++id) {
+    Bytes frame = raw::frameOf(op::kCheckin, {}, id);
+    batch.insert(batch.end(), frame.begin(), frame.end());
+  }
+  const std::size_t frameSize = batch.size() / kBatch;
   std::vector<std::thread> threads;
-  std::atomic<long> calls{0}, ended{0};
+  std::atomic<long> bytes{0}, ended{0};
   for (int r = 0; r < kReaders; ++r) {
     threads.emplace_back([&] {
       while (timeLeft(c)) {
         int fd = raw::connectedAndGreeted(c.socket);
         if (fd < 0) return;
-        Bytes batch;
-        for (std::uint64_t id = 1; id <= 512; ++id) {
-          Bytes frame = raw::frameOf(op::kCheckin, {}, id);
-          batch.insert(batch.end(), frame.begin(), frame.end());
-        }
         fcntl(fd, F_SETFL, O_NONBLOCK);
         bool open = true;
-        while (open && timeLeft(c)) {
+        // Calls written back to back, whole frames only, answers never read.
+        for (std::size_t at = 0; open && timeLeft(c);) {
           pollfd p{fd, POLLOUT, 0};
           if (poll(&p, 1, 100) <= 0) continue;
-          if (p.revents & (POLLERR | POLLHUP)) break;
-          ssize_t n = send(fd, batch.data(), batch.size(), MSG_NOSIGNAL);
+          if (p.revents & (POLLERR | POLLHUP)) {
+            open = false;
+            break;
+          }
+          ssize_t n = send(fd, batch.data() + at, batch.size() - at, MSG_NOSIGNAL);
           if (n < 0 && errno != EAGAIN) open = false;
-          if (n > 0) calls += n / static_cast<long>(batch.size() / 512);
+          if (n <= 0) continue;
+          bytes += n;
+          at = (at + static_cast<std::size_t>(n)) % batch.size();
         }
         if (!open) ++ended;
         close(fd);
@@ -283,14 +290,12 @@ AttackOutcome slowReader(const AttackContext& c) {
     });
   }
   for (auto& t : threads) t.join();
-  o.tries = calls;
-  cutOff = ended;
-  o.note = std::to_string(kReaders) + " peers never reading; cut off " + std::to_string(cutOff) +
-           " times";
+  o.tries = bytes / static_cast<long>(frameSize);
+  o.note = std::to_string(kReaders) + " peers never reading; cut off " +
+           std::to_string(ended.load()) + " times";
   return o;
 }
 
-// Starts this program as `--child MODE SOCKET ARG`; its pid, or -1.
 pid_t spawn(const std::vector<std::string>& args);
 
 // Starts this program as `--child MODE SOCKET ARG`; its pid, or -1.
