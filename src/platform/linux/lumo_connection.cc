@@ -47,6 +47,11 @@ constexpr int kReadsPerTurn = 4;  // then other connections get the I/O thread
 constexpr std::size_t kPauseInvocations = 64;
 constexpr std::size_t kPauseBytes = 1u << 20;
 constexpr std::size_t kHardUndispatchedBytes = 8u << 20;
+// Answers waiting for a peer at which it stops being read: a peer that does not read its answers
+// gets no more work done for it (the kernel holds its calls), and is cut off once they have not
+// moved for kStalledPeerLimit.
+constexpr std::size_t kPiledAnswersBytes = 1u << 20;
+constexpr auto kStalledPeerLimit = std::chrono::seconds(5);
 // While inbound memory is over its process-wide bound, a connection holding an unfinished frame
 // larger than this is cut off: honest clients send small frames that complete at once.
 constexpr std::size_t kLargePartialFrame = 64u << 10;
@@ -336,7 +341,7 @@ bool LumoConnection::readSome(std::string* error) {
       return false;
     }
     updateInboundLocked();
-    if (readPaused_) return true;
+    if (readHeldLocked()) return true;
   }
   return true;
 }
@@ -479,7 +484,7 @@ void LumoConnection::updateInboundLocked() {
 void LumoConnection::updateInterestLocked() {
   if (!resumed_ || !valid_ || !fd_.valid()) return;
   std::uint32_t events = watchingWrites_ ? std::uint32_t{EPOLLOUT} : 0u;
-  if (!readPaused_) events |= EPOLLIN | EPOLLRDHUP;
+  if (!readHeldLocked()) events |= EPOLLIN | EPOLLRDHUP;
   LumoEventLoop::shared().modify(fd_.get(), events);
 }
 
@@ -604,6 +609,11 @@ bool LumoConnection::send(const LumoMessage& message, std::string* error) {
 bool LumoConnection::enqueueLocked(std::unique_ptr<Outgoing> out, bool first, std::string* error) {
   if (outboundBytes_ + out->bytes.size() > kOutboundLimit) return false;
   outboundBytes_ += out->bytes.size();
+  const bool piledNow = !answersPiled_ && outboundBytes_ > kPiledAnswersBytes;
+  if (piledNow) {
+    answersPiled_ = true;
+    updateInterestLocked();
+  }
   if (first && !outbound_.empty() && outbound_.front()->offset == 0) {
     outbound_.push_front(std::move(out));
   } else if (first) {
@@ -611,7 +621,10 @@ bool LumoConnection::enqueueLocked(std::unique_ptr<Outgoing> out, bool first, st
   } else {
     outbound_.push_back(std::move(out));
   }
-  return flushLocked(error);
+  const bool ok = flushLocked(error);
+  // Timed from what the peer took of the answers now, not from before they went out.
+  if (piledNow && answersPiled_) watchForStall(outboundSent_);
+  return ok;
 }
 
 bool LumoConnection::flushLocked(std::string* error) {
@@ -638,6 +651,7 @@ bool LumoConnection::flushLocked(std::string* error) {
     }
     front.fds.clear();  // the descriptors went with the first byte
     front.offset += static_cast<std::size_t>(n);
+    outboundSent_ += static_cast<std::size_t>(n);
     if (front.offset == front.bytes.size()) {
       outboundBytes_ -= front.bytes.size();
       outbound_.pop_front();
@@ -645,11 +659,31 @@ bool LumoConnection::flushLocked(std::string* error) {
   }
   const bool wantWrites = !outbound_.empty() && !held;
   if (outbound_.empty()) sent_.notify_all();
+  if (answersPiled_ && outboundBytes_ <= kPiledAnswersBytes / 2) {
+    answersPiled_ = false;
+    updateInterestLocked();
+  }
   if (wantWrites != watchingWrites_ && resumed_) {
     watchingWrites_ = wantWrites;
     updateInterestLocked();
   }
   return true;
+}
+
+void LumoConnection::watchForStall(std::size_t sentBefore) {
+  std::weak_ptr<LumoConnection> weak = std::static_pointer_cast<LumoConnection>(shared_from_this());
+  queue_->asyncAfter(kStalledPeerLimit, [weak, sentBefore] {
+    auto self = weak.lock();
+    if (!self) return;
+    {
+      std::lock_guard lock(self->mutex_);
+      if (!self->answersPiled_ || !self->valid_) return;
+      if (self->outboundSent_ != sentBefore) return self->watchForStall(self->outboundSent_);
+    }
+    const std::string why = "the peer stopped reading; cut off";
+    SystemLog(kLumoError, "-[LumoConnection send]", why);
+    self->end(why, false);
+  });
 }
 
 bool LumoConnection::waitUntilSent(std::chrono::milliseconds timeout) {
@@ -686,7 +720,8 @@ void LumoConnection::call(const std::string& wireName, std::vector<Value> argume
     } else {
       id = nextId_++;
       pending_[id] = pending;
-      if (waits && ++synchronousWaiting_ == 1 && readPaused_) {
+      const bool held = readHeldLocked();
+      if (waits && ++synchronousWaiting_ == 1 && held) {
         // The answer may sit behind the invocations that paused reading.
         readPaused_ = false;
         updateInterestLocked();
@@ -704,7 +739,7 @@ void LumoConnection::call(const std::string& wireName, std::vector<Value> argume
       pending->answered.wait(lock, [&] { return pending->done; });
     }
     std::lock_guard lock(mutex_);
-    --synchronousWaiting_;
+    if (--synchronousWaiting_ == 0 && answersPiled_) updateInterestLocked();
   }
   if (!why.empty()) {
     if (onError) onError(why);
