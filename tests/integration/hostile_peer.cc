@@ -22,8 +22,7 @@
 #include <thread>
 #include <vector>
 
-#include "platform/linux/lumo/transport/scm_rights.h"
-#include "support/raw_lumo_client.h"
+#include "support/raw_lumo_attacks.h"
 
 using namespace typhora;
 
@@ -33,22 +32,12 @@ namespace {
   for (;;) pause();
 }
 
-// True when the daemon closes the connection within `seconds` (reading and dropping anything).
 bool closedWithin(int fd, int seconds) {
-  const auto until = std::chrono::steady_clock::now() + std::chrono::seconds(seconds);
-  std::uint8_t buffer[4096];
-  while (std::chrono::steady_clock::now() < until) {
-    pollfd p{fd, POLLIN, 0};
-    if (poll(&p, 1, 100) <= 0) continue;
-    if (recv(fd, buffer, sizeof buffer, 0) <= 0) return true;
-  }
-  return false;
+  return raw::closedWithinMs(fd, seconds * 1000);
 }
 
 int connectedAndGreeted(const std::string& socket) {
-  int fd = raw::connectTo(socket);
-  if (fd < 0 || !raw::handshake(fd)) return -1;
-  return fd;
+  return raw::connectedAndGreeted(socket);
 }
 
 int pipeline(const std::string& socket, int seconds) {
@@ -125,13 +114,7 @@ int holdFds(const std::string& socket) {
     for (int i = 0; i < 16; ++i) fds.push_back(open("/dev/null", O_RDONLY | O_CLOEXEC));
     std::vector<std::uint8_t> bytes =
         round == 0 ? header : std::vector<std::uint8_t>{static_cast<std::uint8_t>('x')};
-    iovec iov{bytes.data(), bytes.size()};
-    msghdr msg{};
-    msg.msg_iov = &iov;
-    msg.msg_iovlen = 1;
-    std::vector<char> control;
-    attachDescriptors(&msg, &control, fds);
-    const bool ok = sendmsg(fd, &msg, MSG_NOSIGNAL) > 0;
+    const bool ok = raw::sendWithDescriptors(fd, bytes, fds);
     for (int f : fds) close(f);
     if (!ok) break;
     sent += 16;

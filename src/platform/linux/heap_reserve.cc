@@ -21,7 +21,13 @@ constexpr int kDefaultMmapThreshold = 128 * 1024;
 
 void HeapReserve::prefault(std::size_t bytes) {
   const auto page = static_cast<std::uintptr_t>(sysconf(_SC_PAGESIZE));
-  if (bytes < 4 * page) return;
+  if (bytes < 4 * page) {
+    // A fixed threshold all the same: glibc otherwise raises it to the largest block freed, and
+    // from then on every large frame a client sends is carved from a thread's arena, which keeps
+    // the pages after the frame is gone (a few MiB for each arena, for good).
+    mallopt(M_MMAP_THRESHOLD, kDefaultMmapThreshold);
+    return;
+  }
   // One block from the heap proper (not a mapping of its own), kept after it is freed: its
   // pages then serve the many small allocations that follow.
   mallopt(M_MMAP_THRESHOLD, static_cast<int>(bytes + page));

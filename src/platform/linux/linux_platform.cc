@@ -1,5 +1,7 @@
 #include "platform/linux/linux_platform.h"
 
+#include "platform/linux/files/corrupt_file_quarantine.h"
+
 namespace typhora {
 
 LinuxPlatform::LinuxPlatform(const std::string& root, const std::string& runtimeDir)
@@ -26,6 +28,8 @@ LinuxPlatform::LinuxPlatform(const std::string& root, const std::string& runtime
               sandbox_,      appRegistry_,    appStates_,         analytics_,    buildVariant_,
               launchEvents_, activities_,     assetCatalog_,      systemNotify_, fileEvents_,
               remoteAlert_,  Clock::system(), SerialQueue::main()} {
+  // Before anything reads them: the stores load lazily.
+  CorruptFileQuarantine::sweep(root);
   eventHub_->setActivityRunner(
       [this](const std::string& identifier) { return activities_.runNow(identifier); });
 }

@@ -121,14 +121,22 @@ bool LumoAdmission::inboundOverLimit() const {
 void LumoAdmission::logOnce(const char* kind, uid_t uid, const std::string& message) {
   {
     std::lock_guard lock(mutex_);
-    if (!logged_.emplace(kind, uid).second) return;
+    // A peer going over a limit and back again and again (a user knocking at its cap, a storm
+    // of connections after another) is logged once a while, not once a round.
+    const auto now = std::chrono::steady_clock::now();
+    auto [it, first] = logged_.try_emplace({kind, uid}, LoggedLimit{true, now});
+    if (!first) {
+      if (it->second.active || now - it->second.lastLine < kRelogInterval) return;
+      it->second = {true, now};
+    }
   }
   SystemLog("lumo error: %s - %@", "-[LumoAdmission]", message);
 }
 
 void LumoAdmission::clearLogged(const char* kind, uid_t uid) {
   std::lock_guard lock(mutex_);
-  logged_.erase({kind, uid});
+  auto it = logged_.find({kind, uid});
+  if (it != logged_.end()) it->second.active = false;
 }
 
 std::size_t LumoAdmission::connectionsOf(uid_t uid) const {

@@ -60,7 +60,7 @@ class LumoAdmission {
   void addInbound(std::ptrdiff_t delta) { inbound_.fetch_add(delta, std::memory_order_relaxed); }
   bool inboundOverLimit() const;
 
-  // Logs `message` for `uid` once, until clearLogged(kind, uid).
+  // Logs `message` for `uid` once, until clearLogged(kind, uid) and at most once a minute.
   void logOnce(const char* kind, uid_t uid, const std::string& message);
   void clearLogged(const char* kind, uid_t uid);
 
@@ -82,7 +82,12 @@ class LumoAdmission {
   std::vector<std::function<void()>> retries_;
   std::map<uid_t, std::deque<Waiting>> unidentified_;
   std::size_t unidentifiedCount_ = 0;
-  std::set<std::pair<std::string, uid_t>> logged_;
+  struct LoggedLimit {
+    bool active;  // over the limit since the last line
+    std::chrono::steady_clock::time_point lastLine;
+  };
+  static constexpr auto kRelogInterval = std::chrono::seconds(60);
+  std::map<std::pair<std::string, uid_t>, LoggedLimit> logged_;
   std::atomic<std::ptrdiff_t> inbound_{0};
 };
 

@@ -115,6 +115,9 @@ class LumoConnection final : public IpcConnection {
   bool send(const LumoMessage& message, std::string* error);
   bool enqueueLocked(std::unique_ptr<Outgoing> out, bool first, std::string* error);
   bool flushLocked(std::string* error);
+  // Cuts the peer off unless some of its piled answers have gone out by then.
+  void watchForStall(std::size_t sentBefore);
+  bool readHeldLocked() const { return readPaused_ || (answersPiled_ && synchronousWaiting_ == 0); }
   void end(const std::string& reason, bool peerWentAway);
 
   const bool outgoing_;
@@ -141,6 +144,8 @@ class LumoConnection final : public IpcConnection {
   std::function<void()> interruptionHandler_;
   std::deque<std::unique_ptr<Outgoing>> outbound_;
   std::size_t outboundBytes_ = 0;
+  std::size_t outboundSent_ = 0;  // bytes sent since the start, to tell a stalled peer
+  bool answersPiled_ = false;     // not read while too many of its answers wait
   std::condition_variable sent_;  // outbound_ emptied, or the connection ended
   bool droppedOutbound_ = false;
   bool servingAfterPeerClosed_ = false;  // ended by the peer; one-way messages still served

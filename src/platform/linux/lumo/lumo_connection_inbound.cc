@@ -111,7 +111,7 @@ bool LumoConnection::readSome(std::string* error) {
       return false;
     }
     updateInboundLocked();
-    if (readPaused_) return true;
+    if (readHeldLocked()) return true;
   }
   return true;
 }
@@ -254,7 +254,7 @@ void LumoConnection::updateInboundLocked() {
 void LumoConnection::updateInterestLocked() {
   if (!resumed_ || !valid_ || !fd_.valid()) return;
   std::uint32_t events = watchingWrites_ ? std::uint32_t{EPOLLOUT} : 0u;
-  if (!readPaused_) events |= EPOLLIN | EPOLLRDHUP;
+  if (!readHeldLocked()) events |= EPOLLIN | EPOLLRDHUP;
   LumoEventLoop::shared().modify(fd_.get(), events);
 }
 

@@ -19,6 +19,16 @@ namespace typhora {
 
 using lumo_detail::kLumoError;
 
+namespace {
+
+// Answers waiting for a peer at which it stops being read: a peer that does not read its answers
+// gets no more work done for it (the kernel holds its calls), and is cut off once they have not
+// moved for kStalledPeerLimit.
+constexpr std::size_t kPiledAnswersBytes = 1u << 20;
+constexpr auto kStalledPeerLimit = std::chrono::seconds(5);
+
+}  // namespace
+
 bool LumoConnection::send(const LumoMessage& message, std::string* error) {
   auto out = std::make_unique<Outgoing>();
   std::vector<int> fds;
@@ -47,6 +57,11 @@ bool LumoConnection::send(const LumoMessage& message, std::string* error) {
 bool LumoConnection::enqueueLocked(std::unique_ptr<Outgoing> out, bool first, std::string* error) {
   if (outboundBytes_ + out->bytes.size() > kOutboundLimit) return false;
   outboundBytes_ += out->bytes.size();
+  const bool piledNow = !answersPiled_ && outboundBytes_ > kPiledAnswersBytes;
+  if (piledNow) {
+    answersPiled_ = true;
+    updateInterestLocked();
+  }
   if (first && !outbound_.empty() && outbound_.front()->offset == 0) {
     outbound_.push_front(std::move(out));
   } else if (first) {
@@ -54,7 +69,10 @@ bool LumoConnection::enqueueLocked(std::unique_ptr<Outgoing> out, bool first, st
   } else {
     outbound_.push_back(std::move(out));
   }
-  return flushLocked(error);
+  const bool ok = flushLocked(error);
+  // Timed from what the peer took of the answers now, not from before they went out.
+  if (piledNow && answersPiled_) watchForStall(outboundSent_);
+  return ok;
 }
 
 bool LumoConnection::flushLocked(std::string* error) {
@@ -81,6 +99,7 @@ bool LumoConnection::flushLocked(std::string* error) {
     }
     front.fds.clear();  // the descriptors went with the first byte
     front.offset += static_cast<std::size_t>(n);
+    outboundSent_ += static_cast<std::size_t>(n);
     if (front.offset == front.bytes.size()) {
       outboundBytes_ -= front.bytes.size();
       outbound_.pop_front();
@@ -88,11 +107,31 @@ bool LumoConnection::flushLocked(std::string* error) {
   }
   const bool wantWrites = !outbound_.empty() && !held;
   if (outbound_.empty()) sent_.notify_all();
+  if (answersPiled_ && outboundBytes_ <= kPiledAnswersBytes / 2) {
+    answersPiled_ = false;
+    updateInterestLocked();
+  }
   if (wantWrites != watchingWrites_ && resumed_) {
     watchingWrites_ = wantWrites;
     updateInterestLocked();
   }
   return true;
+}
+
+void LumoConnection::watchForStall(std::size_t sentBefore) {
+  std::weak_ptr<LumoConnection> weak = std::static_pointer_cast<LumoConnection>(shared_from_this());
+  queue_->asyncAfter(kStalledPeerLimit, [weak, sentBefore] {
+    auto self = weak.lock();
+    if (!self) return;
+    {
+      std::lock_guard lock(self->mutex_);
+      if (!self->answersPiled_ || !self->valid_) return;
+      if (self->outboundSent_ != sentBefore) return self->watchForStall(self->outboundSent_);
+    }
+    const std::string why = "the peer stopped reading; cut off";
+    SystemLog(kLumoError, "-[LumoConnection send]", why);
+    self->end(why, false);
+  });
 }
 
 bool LumoConnection::waitUntilSent(std::chrono::milliseconds timeout) {
@@ -129,7 +168,8 @@ void LumoConnection::call(const std::string& wireName, std::vector<Value> argume
     } else {
       id = nextId_++;
       pending_[id] = pending;
-      if (waits && ++synchronousWaiting_ == 1 && readPaused_) {
+      const bool held = readHeldLocked();
+      if (waits && ++synchronousWaiting_ == 1 && held) {
         // The answer may sit behind the invocations that paused reading.
         readPaused_ = false;
         updateInterestLocked();
@@ -147,7 +187,7 @@ void LumoConnection::call(const std::string& wireName, std::vector<Value> argume
       pending->answered.wait(lock, [&] { return pending->done; });
     }
     std::lock_guard lock(mutex_);
-    --synchronousWaiting_;
+    if (--synchronousWaiting_ == 0 && answersPiled_) updateInterestLocked();
   }
   if (!why.empty()) {
     if (onError) onError(why);

@@ -62,19 +62,24 @@ std::shared_ptr<IpcListener> LumoService::makeNamedListener(const std::string& s
     return LumoListener::named(UniqueFd(fd), "");
   }
   const std::string path = runtimeDir_ + "/" + serviceName;
+  // Made under a name of its own and moved into place once it listens with its mode: a client
+  // never finds the path refusing connections, nor open wider than `mode`.
+  const std::string building = path + ".new-" + std::to_string(getpid());
   UniqueFd fd(socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
-  if (path.size() >= sizeof address.sun_path) {
+  if (building.size() >= sizeof address.sun_path) {
     SystemLog("lumo error: %s - %@", "-[LumoService makeNamedListener]", "socket path too long");
     return nullptr;
   }
-  std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
-  unlink(path.c_str());
+  std::memcpy(address.sun_path, building.c_str(), building.size() + 1);
+  unlink(building.c_str());
   if (bind(fd.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 ||
-      chmod(path.c_str(), mode) != 0 || listen(fd.get(), 1024) != 0) {
+      chmod(building.c_str(), mode) != 0 || listen(fd.get(), 1024) != 0 ||
+      rename(building.c_str(), path.c_str()) != 0) {
     SystemLog("lumo error: %s - %@", "-[LumoService makeNamedListener]",
               path + ": " + std::strerror(errno));
+    unlink(building.c_str());
     return nullptr;
   }
   return LumoListener::named(std::move(fd), path);

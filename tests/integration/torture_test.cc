@@ -1,0 +1,88 @@
+// typhora-torture against the real daemon, with small counts: every attack is answered, the
+// daemon keeps serving a well-behaved client throughout, and its descriptors come back.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <fstream>
+#include <iostream>
+#include <sstream>
+
+#include "integration/daemon_test_base.h"
+
+namespace typhora::testing {
+namespace {
+
+using ::testing::HasSubstr;
+using ::testing::Not;
+
+const std::string kTorture = std::string(TYPHORA_BINARY_DIR) + "/tools/typhora-torture";
+
+class TortureTest : public DaemonTestBase {
+ protected:
+  // An entitled application asking in the foreground for a family nobody has, with a dialog
+  // that takes a while to answer: the command the torture kills with the gate and dialog up.
+  std::string foregroundRequester() {
+    const std::string reader = installApp("reader", "com.example.reader",
+                                          R"({"com.zorvane.developer.user-fonts": ["app-usage"]})");
+    fs::create_directories(root_ / "etc/typhora/view-services");
+    std::ofstream(root_ / "etc/typhora/view-services/com.zorvane.FontInstallViewService.plist")
+        << R"({"Program": "/bin/sh", "Arguments": ["-c", "sleep 0.2; exec )" << kCtl
+        << R"( view-service \"$@\"", "view-service"]})";
+    const fs::path wrapper = dir_ / "foreground";
+    std::ofstream(wrapper) << "#!/bin/sh\n"
+                           << kCtl << " --root " << root_.string()
+                           << " app-state set $$ 8 >/dev/null && exec \"$@\"\n";
+    fs::permissions(wrapper, fs::perms::owner_all);
+    return wrapper.string() + " " + reader + " --runtime-dir " + runtime_.string() +
+           " request-fonts --family";
+  }
+
+  std::vector<std::string> torture(std::vector<std::string> extra) const {
+    std::vector<std::string> argv = {kTorture, "--runtime-dir", runtime_.string(), "--json"};
+    argv.insert(argv.end(), extra.begin(), extra.end());
+    return argv;
+  }
+};
+
+TEST_F(TortureTest, EveryAttackLeavesTheDaemonServingAndRefusesEveryBorrowedIdentity) {
+  const std::string requester = foregroundRequester();
+  startDaemon();
+  auto run = runCommand(
+      torture({"--seconds", "2", "--storm", "300", "--requester", requester + " Missing"}), 180s);
+  std::cout << "[figures]\n" << run.out;
+  EXPECT_EQ(run.status, 0) << run.all << daemon_->output();
+  std::istringstream rows(run.out);
+  std::string row;
+  int count = 0;
+  while (std::getline(rows, row)) {
+    ++count;
+    EXPECT_THAT(row, HasSubstr(R"("serving":true)"));
+    EXPECT_THAT(row, HasSubstr(R"("gotThrough":0,)"));
+    EXPECT_THAT(row, Not(HasSubstr(R"("tries":0,)")));
+  }
+  EXPECT_EQ(count, 8) << run.out;
+  EXPECT_THAT(run.out, HasSubstr("requesters with the gate or dialog up"));
+  // Requesters killed with the gate held left it free for the next one.
+  std::istringstream words(requester + " A");
+  std::vector<std::string> argv;
+  for (std::string w; words >> w;) argv.push_back(w);
+  auto after = runCommand(argv, 30s);
+  EXPECT_EQ(after.status, 0) << after.all << daemon_->output();
+  EXPECT_EQ(daemon_->waitFor(0ms), -1) << daemon_->output();
+  // What a hostile peer reaches is logged once per peer, not once per message.
+  EXPECT_LT(daemon_->countLines("holds too many connections"), 5u) << daemon_->output();
+}
+
+TEST_F(TortureTest, ADaemonThatStopsServingFailsTheRow) {
+  startDaemon();
+  ChildProcess run(torture({"--seconds", "4", "--only", "churn"}));
+  std::this_thread::sleep_for(1s);
+  daemon_->kill(SIGKILL);
+  daemon_->wait();
+  ASSERT_EQ(run.waitFor(60s), 1) << run.output();
+  run.finishOutput();
+  EXPECT_THAT(run.standardOutput(), HasSubstr(R"("serving":false)"));
+}
+
+}  // namespace
+}  // namespace typhora::testing
