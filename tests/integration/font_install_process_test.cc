@@ -58,6 +58,7 @@ TEST_F(FontInstallProcessTest, ACheckedInClientHearsOfInstalledRemovedAndDisable
   ASSERT_EQ(listed.status, 0) << listed.all;
   EXPECT_THAT(listed.out, HasSubstr(R"("DejaVuSans":"DejaVu Sans")"));
   EXPECT_THAT(listed.out, Not(HasSubstr("com.example.shop")));
+  EXPECT_THAT(listed.out, Not(HasSubstr(R"("enabled":false)")));  // installed enabled
 
   auto disabled = font({"disable", kInstalled + "DejaVuSans.ttf"});
   ASSERT_EQ(disabled.status, 0) << disabled.all;
@@ -122,6 +123,26 @@ TEST_F(FontInstallProcessTest, AProviderIsRemovedWholeWithoutARunningDaemon) {
   EXPECT_FALSE(fs::exists(root_ / kInstalled.substr(1)));
   EXPECT_THAT(font({"list"}).out, Not(HasSubstr("com.example.fonts")));
   EXPECT_THAT(font({"list"}).out, HasSubstr("com.example.shop/A.otf"));
+}
+
+// Installers running at once each read the user-fonts file, add their faces and write it back: none
+// may write over another's change with its older copy.
+TEST_F(FontInstallProcessTest, InstallersRunningAtOnceKeepEachOthersFonts) {
+  const std::vector<std::string> faces = {"DejaVuSans.ttf",         "DejaVuSans-Bold.ttf",
+                                          "DejaVuSans-Oblique.ttf", "DejaVuSansCondensed.ttf",
+                                          "DejaVuSansMono.ttf",     "DejaVuSerif.ttf",
+                                          "DejaVuSerif-Bold.ttf",   "DejaVuSansMono-Bold.ttf"};
+  std::vector<std::unique_ptr<ChildProcess>> installers;
+  for (std::size_t i = 0; i < faces.size(); ++i) {
+    installers.push_back(std::make_unique<ChildProcess>(std::vector<std::string>{
+        kCtl, "--runtime-dir", runtime_, "--root", root_.string(), "font", "install", "--provider",
+        "com.example.p" + std::to_string(i), kDejaVu + faces[i]}));
+  }
+  for (auto& installer : installers) EXPECT_EQ(installer->wait(), 0) << installer->output();
+  const std::string listed = font({"list"}).out;
+  for (std::size_t i = 0; i < faces.size(); ++i) {
+    EXPECT_THAT(listed, HasSubstr("com.example.p" + std::to_string(i) + "/" + faces[i]));
+  }
 }
 
 }  // namespace

@@ -5,9 +5,9 @@
 #include <set>
 
 #include "ipc/interface_descriptions.h"
-#include "platform/value/json_codec.h"
-#include "platform/linux/fonts/linux_user_font_manager.h"
 #include "platform/dispatch/semaphore.h"
+#include "platform/linux/fonts/linux_user_font_manager.h"
+#include "platform/value/json_codec.h"
 #include "service_session.h"
 
 namespace typhora::ctl {
@@ -168,10 +168,11 @@ int list(LinuxUserFontManager& registry, std::vector<std::string> args) {
   if (const Dictionary* info = fontsInfo.asDictionary()) {
     for (const auto& [path, record] : info->entries()) {
       if (!provider.empty() && providerOf(path) != provider) continue;
-      fonts.push_back(Value::dictionary({{"path", path},
-                                         {"provider", providerOf(path)},
-                                         {"enabled", !record.get("disabled").asBool()},
-                                         {"faces", record.get("familyName")}}));
+      fonts.push_back(
+          Value::dictionary({{"path", path},
+                             {"provider", providerOf(path)},
+                             {"enabled", !record.get("disabled").asBool().value_or(false)},
+                             {"faces", record.get("familyName")}}));
     }
   }
   std::cout << JsonCodec::encode(Value(std::move(fonts))) << "\n";

@@ -6,13 +6,14 @@
 #include <map>
 #include <set>
 
-#include "platform/value/cbor_codec.h"
+#include "platform/fd/regular_file.h"
 #include "platform/linux/files/atomic_file.h"
 #include "platform/linux/files/device_root.h"
 #include "platform/linux/fonts/font_face_names.h"
+#include "platform/linux/fonts/registry_lock.h"
 #include "platform/log/log.h"
+#include "platform/value/cbor_codec.h"
 #include "platform/value/plist_reader.h"
-#include "platform/fd/regular_file.h"
 
 namespace typhora {
 
@@ -21,6 +22,7 @@ namespace fs = std::filesystem;
 namespace {
 
 constexpr const char* kUserFontsInfo = "/var/mobile/Library/UserFonts/UserFonts.plist";
+constexpr const char* kRegistryLockFile = "/var/mobile/Library/UserFonts/.registry.lock";
 constexpr const char* kProfileFontsInfo = "/var/mobile/Library/UserFonts/ProfileFonts.plist";
 constexpr const char* kProviders = "/var/mobile/Library/UserFonts/FontProviders.plist";
 // The mirror paths whose records the user-fonts file holds, written after it: when the asset
@@ -58,6 +60,7 @@ std::vector<std::string> subdirectories(const std::string& machinePath) {
 LinuxUserFontManager::LinuxUserFontManager(std::string root)
     : root_(root),
       files_(std::move(root)),
+      lockFile_(root_.onDisk(kRegistryLockFile)),
       queue_(SerialQueue::create("com.zorvane.typhora.fontRegistry")) {}
 
 void LinuxUserFontManager::reset() {
@@ -110,7 +113,7 @@ void LinuxUserFontManager::enableOrDisablePersistentURLs(const std::vector<std::
     if (url.starts_with(kFileUrlScheme))
       paths.insert(url.substr(std::string(kFileUrlScheme).size()));
   }
-  std::lock_guard lock(mutex_);
+  RegistryLock lock(mutex_, lockFile_);
   std::vector<DictionaryEntry> entries = entriesOf(userFontsInfo());
   bool changed = false;
   for (auto& [path, record] : entries) {
@@ -146,7 +149,7 @@ void LinuxUserFontManager::unregisterAndRemoveFontFilesForIdentifier(
   queue_->async([this, identifier, completionHandler = std::move(completionHandler)] {
     std::optional<std::string> error;
     {
-      std::lock_guard lock(mutex_);
+      RegistryLock lock(mutex_, lockFile_);
       error = removeProviderLocked(identifier);
     }
     completionHandler(error);
@@ -154,7 +157,7 @@ void LinuxUserFontManager::unregisterAndRemoveFontFilesForIdentifier(
 }
 
 void LinuxUserFontManager::synchronizeFontProviders() {
-  std::lock_guard lock(mutex_);
+  RegistryLock lock(mutex_, lockFile_);
   ValueArray providers;
   for (const std::string& name : subdirectories(root_.onDisk(kFontFiles))) {
     if (identifierFromDirectoryName(name)) providers.emplace_back(name);
@@ -170,7 +173,7 @@ void LinuxUserFontManager::synchronizeFontProviders() {
 void LinuxUserFontManager::synchronizeFontAssets(std::function<void(bool success)> completion) {
   bool success = false;
   {
-    std::lock_guard lock(mutex_);
+    RegistryLock lock(mutex_, lockFile_);
     success = mirrorAssetsLocked();
   }
   completion(success);
@@ -208,7 +211,7 @@ std::optional<std::vector<std::string>> LinuxUserFontManager::installFontFiles(
     checked.push_back({path, std::move(*bytes), std::move(*names)});
   }
 
-  std::lock_guard lock(mutex_);
+  RegistryLock lock(mutex_, lockFile_);
   std::vector<std::string> written;
   auto undo = [&] {
     std::string ignored;
@@ -235,7 +238,7 @@ std::optional<std::vector<std::string>> LinuxUserFontManager::installFontFiles(
 
 bool LinuxUserFontManager::removeFontFiles(const std::vector<std::string>& paths,
                                            std::string* error) {
-  std::lock_guard lock(mutex_);
+  RegistryLock lock(mutex_, lockFile_);
   std::vector<DictionaryEntry> entries = entriesOf(userFontsInfo());
   const std::set<std::string> removed(paths.begin(), paths.end());
   for (const std::string& path : removed) {

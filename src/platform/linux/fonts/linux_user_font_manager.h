@@ -9,7 +9,8 @@
 // The asset store holds <asset>/AssetData/<font file> under
 // /private/var/Cargell/AssetsV2/com_zorvane_Cargell_Font6/.
 //
-// Every change to the registry's files is made under one lock and written atomically.
+// Every change to the registry's files is made under one lock, shared with other processes that
+// change them, and written atomically.
 #pragma once
 
 #include <memory>
@@ -63,7 +64,8 @@ class LinuxUserFontManager final : public TYUserFontManager {
 
   DeviceRoot root_;
   LinuxFileSystem files_;  // removals beneath the root, never through a link
-  std::mutex mutex_;       // every change to the registry's files
+  std::mutex mutex_;       // every change to the registry's files, with lockFile_
+  std::string lockFile_;   // the registry's lock between processes
   std::shared_ptr<SerialQueue> queue_;
 };
 
