@@ -67,8 +67,17 @@ bool LumoAdmission::mayAccept(std::function<void()> retry) {
 
 void LumoAdmission::awaitHello(uid_t uid, const std::shared_ptr<LumoConnection>& connection) {
   std::lock_guard lock(mutex_);
-  unidentified_[uid].push_back({connection.get(), connection, std::chrono::steady_clock::now()});
+  unidentified_[uid].push_back({connection.get(), connection, std::nullopt});
   ++unidentifiedCount_;
+}
+
+void LumoAdmission::helloSent(uid_t uid, const LumoConnection* connection) {
+  std::lock_guard lock(mutex_);
+  auto it = unidentified_.find(uid);
+  if (it == unidentified_.end()) return;
+  for (Waiting& waiting : it->second) {
+    if (waiting.key == connection) waiting.since = std::chrono::steady_clock::now();
+  }
 }
 
 std::shared_ptr<LumoConnection> LumoAdmission::evictionVictimLocked() {
@@ -77,10 +86,15 @@ std::shared_ptr<LumoConnection> LumoAdmission::evictionVictimLocked() {
       [](const auto& a, const auto& b) { return a.second.size() < b.second.size(); });
   if (most == unidentified_.end() || most->second.empty()) return nullptr;
   if (most->second.size() * 4 < limits_.unidentified) return nullptr;
-  // Honest peers answer the hello at once: only one silent past the grace is cut off.
-  if (std::chrono::steady_clock::now() - most->second.front().since < kHelloGrace) return nullptr;
-  Waiting oldest = std::move(most->second.front());
-  most->second.pop_front();
+  // Honest peers answer the hello at once: only one silent past the grace since its hello went
+  // out is cut off, never one still waiting for its hello.
+  const auto now = std::chrono::steady_clock::now();
+  auto silent = std::find_if(most->second.begin(), most->second.end(), [now](const Waiting& w) {
+    return w.since && now - *w.since >= kHelloGrace;
+  });
+  if (silent == most->second.end()) return nullptr;
+  Waiting oldest = std::move(*silent);
+  most->second.erase(silent);
   --unidentifiedCount_;
   if (most->second.empty()) unidentified_.erase(most);
   return oldest.connection.lock();

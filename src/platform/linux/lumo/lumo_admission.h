@@ -15,6 +15,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <set>
 #include <string>
 #include <vector>
@@ -51,8 +52,12 @@ class LumoAdmission {
   bool mayAccept(std::function<void()> retry);
   static constexpr auto kHelloGrace = std::chrono::seconds(1);
 
-  // `connection` waits for its peer's hello.
+  // `connection` was accepted and will owe its peer's hello: it counts against the cap at once,
+  // so a burst accepted faster than the listener's delegate greets it is held to the cap too.
   void awaitHello(uid_t uid, const std::shared_ptr<LumoConnection>& connection);
+  // The hello went out to `connection`'s peer: from now on its silence counts, and it may be cut
+  // off once it has been silent for kHelloGrace.
+  void helloSent(uid_t uid, const LumoConnection* connection);
   // The connection's handshake finished or it ended.
   void helloDone(uid_t uid, const LumoConnection* connection);
 
@@ -77,7 +82,7 @@ class LumoAdmission {
   struct Waiting {
     const LumoConnection* key;
     std::weak_ptr<LumoConnection> connection;
-    std::chrono::steady_clock::time_point since;
+    std::optional<std::chrono::steady_clock::time_point> since;  // the hello went out
   };
   std::vector<std::function<void()>> retries_;
   std::map<uid_t, std::deque<Waiting>> unidentified_;

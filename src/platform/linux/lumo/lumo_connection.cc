@@ -65,6 +65,11 @@ LumoConnection::LumoConnection(bool outgoing)
 LumoConnection::~LumoConnection() {
   if (fd_.valid()) LumoEventLoop::shared().remove(fd_.get());
   LumoAdmission::shared().addInbound(-static_cast<std::ptrdiff_t>(inboundAccounted_));
+  // An accepted connection dropped without ever ending still gives back its slots.
+  if (!outgoing_ && handshake_ != Handshake::Done) {
+    LumoAdmission::shared().helloDone(pin_.token().uid, this);
+  }
+  if (admitted_) LumoAdmission::shared().release(pin_.token().uid);
 }
 
 std::shared_ptr<LumoConnection> LumoConnection::adopt(UniqueFd fd, ProcessPin peer) {
@@ -84,8 +89,7 @@ void LumoConnection::greet() {
   // once they carry the nonce. The hello goes out only now, so a peer's handshake never waits on
   // the listener's delegate, and a client opening connections one handshake at a time is paced
   // by how fast they are admitted.
-  LumoAdmission::shared().awaitHello(pin_.token().uid,
-                                     std::static_pointer_cast<LumoConnection>(shared_from_this()));
+  LumoAdmission::shared().helloSent(pin_.token().uid, this);
   std::string error;
   send(helloWith(nonce_), &error);
 }

@@ -153,7 +153,9 @@ bool LumoListener::offer(UniqueFd fd) {
   }
   if (!peer.pinned()) return true;  // gone, or not identifiable: nothing may speak for it
   if (!LumoAdmission::shared().admit(peer.token().uid)) return true;
+  const uid_t uid = peer.token().uid;
   auto connection = LumoConnection::adopt(std::move(fd), std::move(peer));
+  LumoAdmission::shared().awaitHello(uid, connection);
   auto self = shared_from_this();
   queue_->async([self, connection] {
     std::shared_ptr<IpcListenerDelegate> delegate;

@@ -1,8 +1,13 @@
 // The per-user connection cap: refused connections are logged once, however often the user knocks
 // at its cap or comes back to it.
 #include <gtest/gtest.h>
+#include <sys/socket.h>
+
+#include <thread>
+#include <vector>
 
 #include "platform/linux/lumo/lumo_admission.h"
+#include "platform/linux/lumo/lumo_connection.h"
 #include "support/log_capture.h"
 
 namespace typhora::testing {
@@ -37,6 +42,39 @@ TEST(LumoAdmissionTest, AUserKnockingAtItsCapIsLoggedOnceNotPerConnection) {
   for (const LogLine& l : log.lines()) logged += l.message.find(line) != std::string::npos;
   EXPECT_EQ(logged, 1u);
   for (int i = 0; i < 8; ++i) admission.release(kUser);
+  admission.setLimits(saved);
+}
+
+// Accepted connections count against the cap of unfinished handshakes from the accept on, even
+// while the listener's delegate has not greeted them yet; only one whose hello went out and that
+// stayed silent past the grace may be cut off to make room.
+TEST(LumoAdmissionTest, UngreetedConnectionsCountAgainstTheCapAndAreNeverCutOff) {
+  LumoAdmission& admission = LumoAdmission::shared();
+  const LumoAdmissionLimits saved = admission.limits();
+  LumoAdmissionLimits limits = saved;
+  limits.unidentified = 4;
+  admission.setLimits(limits);
+  std::vector<std::shared_ptr<LumoConnection>> accepted;
+  std::vector<UniqueFd> peers;
+  for (int i = 0; i < 4; ++i) {
+    int pair[2];
+    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair), 0);
+    peers.emplace_back(pair[1]);
+    auto connection = LumoConnection::adopt(UniqueFd(pair[0]), ProcessPin::ofSocketPeer(pair[0]));
+    admission.awaitHello(connection->auditToken().uid, connection);
+    accepted.push_back(connection);
+  }
+  EXPECT_FALSE(admission.mayAccept([] {}));  // full, and nobody has been greeted
+  std::this_thread::sleep_for(LumoAdmission::kHelloGrace);
+  EXPECT_FALSE(admission.mayAccept([] {}));  // still nobody owes an answer to a hello
+  admission.helloSent(accepted[2]->auditToken().uid, accepted[2].get());
+  std::this_thread::sleep_for(LumoAdmission::kHelloGrace);
+  EXPECT_TRUE(admission.mayAccept([] {}));  // the greeted, silent one made room
+  EXPECT_FALSE(accepted[2]->isValid());
+  EXPECT_TRUE(accepted[0]->isValid());
+  EXPECT_EQ(admission.unidentifiedCount(), 3u);
+  for (auto& connection : accepted) connection->invalidate();
+  EXPECT_EQ(admission.unidentifiedCount(), 0u);
   admission.setLimits(saved);
 }
 
