@@ -177,7 +177,7 @@ int BusServer::answer(sd_bus_message* call, void* self, sd_bus_error*) {
 }
 
 bool callBus(sd_bus* client, const char* method) {
-  sd_bus_error error = SD_BUS_ERROR_NULL;
+  sd_bus_error error{};  // the same as SD_BUS_ERROR_NULL, which is C99 only
   sd_bus_message* reply = nullptr;
   int r = sd_bus_call_method(client, BusServer::kName, BusServer::kPath, kInterface, method, &error,
                              &reply, "");

@@ -194,7 +194,10 @@ int main(int argc, char** argv) {
   bool allHeld = true;
   for (const Attack& attack : allAttacks()) {
     if (!selected(options, attack.name)) continue;
-    Row row{attack.name, {}, false, {}, gauge.rssKb(), 0, gauge.descriptors(), 0};
+    Row row;
+    row.name = attack.name;
+    row.rssBefore = gauge.rssKb();
+    row.fdsBefore = gauge.descriptors();
     const auto from = ProbeClient::Clock::now();
     context.until = from + std::chrono::duration_cast<std::chrono::steady_clock::duration>(
                                std::chrono::duration<double>(options.seconds));

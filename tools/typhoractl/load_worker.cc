@@ -94,10 +94,15 @@ void LoadWorker::report(int fd, long notifications) const {
   std::string text;
   for (const auto& [name, operation] : operations_) {
     text += name + " " + std::to_string(operation.errors);
-    for (double ms : operation.latencies) text += " " + std::to_string(ms);
+    for (double ms : operation.latencies) {
+      text += ' ';  // appended piecewise: g++ 12 warns falsely on "literal" + std::string&&
+      text += std::to_string(ms);
+    }
     text += "\n";
   }
-  text += "notifications " + std::to_string(notifications) + "\n";
+  text += "notifications ";
+  text += std::to_string(notifications);
+  text += '\n';
   for (const std::string& error : errors_) {
     std::string line = error;
     std::replace(line.begin(), line.end(), '\n', ' ');
