@@ -37,7 +37,7 @@ TEST_F(IntrospectionProcessTest, StatusAndGrantsShowCheckedInClientsAndWhatTheyW
   EXPECT_THAT(table.out, HasSubstr("com.example.browser"));
   EXPECT_THAT(table.out, HasSubstr("enumeration"));
 
-  // Every line of the exposition is a comment or `name{labels} value`.
+  // Every line of the metrics text is a comment or `name{labels} value`.
   auto metrics = ctl({"status", "--metrics"});
   ASSERT_EQ(metrics.status, 0) << metrics.all;
   EXPECT_THAT(metrics.out, HasSubstr("typhora_checked_in_clients 1\n"));
