@@ -4,6 +4,8 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <signal.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <iostream>
 #include <map>
@@ -119,9 +121,22 @@ TEST_F(CrashSafetyTest, AWriterKilledAtRandomNeverLeavesATornEmptyOrStaleFile) {
             << " files holding a step whose commit the writer had not yet reported\n";
 }
 
-TEST_F(CrashSafetyTest, DamagedStateFilesAreSetAsideAtStartAndTheDaemonServes) {
+// A pid that named a process which has ended.
+pid_t endedPid() {
+  const pid_t child = fork();
+  if (child == 0) _exit(0);
+  waitpid(child, nullptr, 0);
+  return child;
+}
+
+TEST_F(CrashSafetyTest, DamagedStateFilesAreSetAsideAndKilledWritersLeftoversRemovedAtStart) {
   fs::create_directories(preferences().parent_path());
   fs::create_directories(appStates().parent_path());
+  // What writers killed mid-write leave; one whose writer still runs is its to finish.
+  const fs::path dead = userFonts().string() + ".tmp-" + std::to_string(endedPid());
+  const fs::path deadPreferences = preferences().string() + ".tmp-" + std::to_string(endedPid());
+  const fs::path live = assets().string() + ".tmp-" + std::to_string(getpid());
+  for (const fs::path& leftover : {dead, deadPreferences, live}) std::ofstream(leftover) << "{}";
   std::ofstream{preferences()};  // empty
   std::ofstream(userFonts()) << R"({"/var/mobile/Library/UserFonts/FontFiles/a.otf": {"fam)";
   std::ofstream(assets()) << std::string("\xbf\x61", 2);  // a CBOR map cut short
@@ -138,6 +153,10 @@ TEST_F(CrashSafetyTest, DamagedStateFilesAreSetAsideAtStartAndTheDaemonServes) {
     EXPECT_TRUE(setAside) << original;
   }
   EXPECT_THAT(daemon_->output(), HasSubstr("UserFonts.plist is corrupt"));
+  EXPECT_FALSE(fs::exists(dead));
+  EXPECT_FALSE(fs::exists(deadPreferences));
+  EXPECT_TRUE(fs::exists(live));
+  EXPECT_EQ(daemon_->countLines("that ended mid-write"), 2u) << daemon_->output();
 }
 
 }  // namespace

@@ -5,11 +5,12 @@
 #include <cstdio>
 #include <ctime>
 
+#include "platform/fd/regular_file.h"
 #include "platform/linux/files/device_root.h"
 #include "platform/linux/files/preferences_file_store.h"
+#include "platform/linux/files/stale_temporary_files.h"
 #include "platform/log/log.h"
 #include "platform/value/plist_reader.h"
-#include "platform/fd/regular_file.h"
 
 namespace typhora {
 
@@ -27,9 +28,12 @@ void CorruptFileQuarantine::sweep(const std::string& root) {
         "/var/mobile/Library/UserFonts/ProfileFonts.plist",
         "/var/mobile/Library/UserFonts/FontProviders.plist",
         "/var/mobile/Library/UserFonts/FontAssets.plist", "/var/run/typhora/app-states.plist"}) {
+    StaleTemporaryFiles::removeBeside(device.onDisk(path));
     setAsideIfUndecodable(device.onDisk(path));
   }
-  setAsideIfUndecodable(PreferencesFileStore::pathFor(root, "com.zorvane.typhorad"));
+  const std::string preferences = PreferencesFileStore::pathFor(root, "com.zorvane.typhorad");
+  StaleTemporaryFiles::removeBeside(preferences);
+  setAsideIfUndecodable(preferences);
 }
 
 std::optional<std::string> CorruptFileQuarantine::setAsideIfUndecodable(const std::string& path) {
