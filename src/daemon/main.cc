@@ -12,9 +12,10 @@
 #include <string>
 
 #include "daemon/typhora_daemon.h"
-#include "platform/linux/files/device_root.h"
 #include "platform/linux/events/event_socket_protocol.h"
+#include "platform/linux/files/device_root.h"
 #include "platform/linux/heap_reserve.h"
+#include "platform/linux/heap_trimmer.h"
 #include "platform/linux/linux_platform.h"
 #include "platform/linux/lumo/lumo_connection.h"
 #include "platform/log/log.h"
@@ -147,6 +148,8 @@ int main(int argc, char** argv) {
     std::fflush(stderr);
     std::_Exit(EXIT_FAILURE);
   }
+  // After start-up, whose reserved heap is in use by then: bursts of clients leave free pages.
+  typhora::HeapTrimmer::start(std::chrono::seconds(5), 8u << 20);
   typhora::SystemLog("typhorad ready: device root %s, runtime directory %s", options.root,
                      options.runtimeDir);
   daemon.run();

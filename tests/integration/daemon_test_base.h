@@ -23,6 +23,19 @@ inline const std::string kDaemon = std::string(TYPHORA_BINARY_DIR) + "/src/typho
 inline const std::string kCtl = std::string(TYPHORA_BINARY_DIR) + "/tools/typhoractl";
 inline constexpr const char* kService = "com.zorvane.typhorad";
 
+// Sanitizers' shadow memory makes resident sizes say nothing about the daemon's own.
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+inline constexpr bool kMemoryMeasurable = false;
+#elif defined(__has_feature)
+#if __has_feature(address_sanitizer) || __has_feature(thread_sanitizer)
+inline constexpr bool kMemoryMeasurable = false;
+#else
+inline constexpr bool kMemoryMeasurable = true;
+#endif
+#else
+inline constexpr bool kMemoryMeasurable = true;
+#endif
+
 class DaemonTestBase : public ::testing::Test {
  protected:
   void SetUp() override {

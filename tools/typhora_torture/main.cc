@@ -129,6 +129,28 @@ long settledDescriptors(const DaemonGauge& gauge, long baseline) {
   return now;
 }
 
+// The daemon's resident memory once the attackers are gone: what it keeps of what they made it
+// allocate. Waits up to twenty seconds for it to come back near `baselineKb`.
+long settledRssKb(const DaemonGauge& gauge, long baselineKb) {
+  long now = gauge.rssKb();
+  for (int i = 0; i < 200 && now > baselineKb + 8 * 1024; ++i) {
+    std::this_thread::sleep_for(100ms);
+    now = gauge.rssKb();
+  }
+  return now;
+}
+
+void printSettled(long rssBaseline, long rssAfter, long fdsBaseline, long fdsAfter, bool json) {
+  if (json) {
+    std::printf("{\"settled\":{\"rssKb\":[%ld,%ld],\"descriptors\":[%ld,%ld]}}\n", rssBaseline,
+                rssAfter, fdsBaseline, fdsAfter);
+  } else {
+    std::printf("after the attackers left: RSS %ld -> %ld kB, descriptors %ld -> %ld\n",
+                rssBaseline, rssAfter, fdsBaseline, fdsAfter);
+  }
+  std::fflush(stdout);
+}
+
 void printRow(const Row& r, bool json) {
   const AttackOutcome& o = r.outcome;
   if (json) {
@@ -192,6 +214,8 @@ int main(int argc, char** argv) {
                 "serving", "worst ms", "p99 ms", "RSS kB", "descriptors", "notes");
   }
   bool allHeld = true;
+  const long rssBaseline = gauge.rssKb();
+  const long fdsBaseline = gauge.descriptors();
   for (const Attack& attack : allAttacks()) {
     if (!selected(options, attack.name)) continue;
     Row row;
@@ -211,5 +235,9 @@ int main(int argc, char** argv) {
     if (!gauge.alive()) break;
   }
   probe.stop();
+  if (gauge.alive()) {
+    const long fds = settledDescriptors(gauge, fdsBaseline);
+    printSettled(rssBaseline, settledRssKb(gauge, rssBaseline), fdsBaseline, fds, options.json);
+  }
   return allHeld ? 0 : 1;
 }
