@@ -14,6 +14,7 @@
 #include "platform/linux/lumo/lumo_admission.h"
 #include "platform/linux/lumo/lumo_connection_parts.h"
 #include "platform/linux/lumo/lumo_endpoint.h"
+#include "platform/linux/lumo/lumo_peer_log.h"
 #include "platform/linux/lumo/transport/lumo_event_loop.h"
 #include "platform/linux/lumo/transport/scm_rights.h"
 #include "platform/log/log.h"
@@ -22,7 +23,6 @@ namespace typhora {
 
 using lumo_detail::finish;
 using lumo_detail::helloWith;
-using lumo_detail::kLumoError;
 
 namespace {
 
@@ -78,6 +78,7 @@ std::shared_ptr<LumoConnection> LumoConnection::adopt(UniqueFd fd, ProcessPin pe
   passCredentials(fd.get());
   connection->fd_ = std::move(fd);
   connection->pin_ = std::move(peer);
+  connection->peerUid_ = connection->pin_.token().uid;
   connection->admitted_ = true;
   connection->handshake_ = Handshake::AwaitingAck;
   getrandom(connection->nonce_.data(), connection->nonce_.size(), 0);
@@ -213,7 +214,7 @@ void LumoConnection::resume() {
     }
   }
   if (!error.empty()) {
-    SystemLog(kLumoError, "-[LumoConnection resume]", error);
+    peerError("-[LumoConnection resume]", error);
     end(error, false);
     return;
   }
@@ -287,6 +288,10 @@ void LumoConnection::end(const std::string& reason, bool peerWentAway) {
       kept = std::move(self->exportedObject_);
     }
   });
+}
+
+void LumoConnection::peerError(const char* where, const std::string& why) const {
+  LumoPeerLog::shared().error(peerUid_.load(), where, why);
 }
 
 }  // namespace typhora

@@ -28,6 +28,7 @@
 #include <sys/socket.h>
 
 #include <array>
+#include <atomic>
 #include <chrono>
 #include <condition_variable>
 #include <deque>
@@ -110,6 +111,8 @@ class LumoConnection final : public IpcConnection {
   void dispatched(std::size_t bytes, std::size_t descriptors);
   void refuse(const LumoMessage& message, const std::string& why);
   void refuseOnce(const std::string& why);
+  // A "lumo error" line about this connection's peer, within the budget of the peer's user.
+  void peerError(const char* where, const std::string& why) const;
   std::optional<LumoMessage> decode(LumoRawFrame frame, std::string* error);
   // Any thread.
   bool send(const LumoMessage& message, std::string* error);
@@ -129,6 +132,8 @@ class LumoConnection final : public IpcConnection {
   std::string path_;
   std::shared_ptr<const IpcEndpoint> endpoint_;
   ProcessPin pin_;
+  // pin_'s user, for log lines written without the lock (-1 until the peer is known).
+  std::atomic<uid_t> peerUid_{static_cast<uid_t>(-1)};
   Handshake handshake_ = Handshake::AwaitingHello;
   std::array<std::uint8_t, 16> nonce_{};
   bool admitted_ = false;  // counted by LumoAdmission (accepted connections)

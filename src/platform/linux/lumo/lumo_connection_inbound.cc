@@ -19,7 +19,7 @@ namespace typhora {
 
 using lumo_detail::finish;
 using lumo_detail::helloWith;
-using lumo_detail::kLumoError;
+using lumo_detail::kPeerClosed;
 
 namespace {
 
@@ -72,7 +72,7 @@ bool LumoConnection::readSome(std::string* error) {
     if (n < 0 && errno == EINTR) continue;
     if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) return true;
     if (n <= 0) {
-      *error = n == 0 ? "the peer closed the connection" : std::strerror(errno);
+      *error = n == 0 ? kPeerClosed : std::strerror(errno);
       return false;
     }
     std::vector<UniqueFd> fds = takeDescriptors(&msg);
@@ -125,6 +125,7 @@ bool LumoConnection::checkWriter(const ucred& writer, std::string* error) {
   } else if (outgoing_ && handshake_ == Handshake::AwaitingHello && !pin_.pinned()) {
     // The Hello's writer becomes the peer; every later read must come from it.
     pin_ = ProcessPin::ofWriter(pid, uid, writer.gid);
+    peerUid_ = pin_.token().uid;
     if (!pin_.pinned()) *error = "the peer that wrote the hello cannot be identified";
   } else if (pid != pin_.token().pid || uid != pin_.token().uid) {
     *error = "a frame written by process " + std::to_string(pid) + ", not by the peer " +
@@ -133,7 +134,7 @@ bool LumoConnection::checkWriter(const ucred& writer, std::string* error) {
   if (error->empty()) return true;
   if (!refusalLogged_) {
     refusalLogged_ = true;
-    SystemLog(kLumoError, "-[LumoConnection read]", *error);
+    peerError("-[LumoConnection read]", *error);
   }
   return false;
 }
@@ -203,7 +204,7 @@ bool LumoConnection::takeHello(LumoRawFrame frame, std::string* error) {
     *error = "a hello that does not carry this connection's nonce";
     if (!refusalLogged_) {
       refusalLogged_ = true;
-      SystemLog(kLumoError, "-[LumoConnection read]", *error);
+      peerError("-[LumoConnection read]", *error);
     }
     return false;
   }
@@ -240,7 +241,7 @@ void LumoConnection::routeReply(LumoRawFrame frame) {
 std::optional<LumoMessage> LumoConnection::decode(LumoRawFrame frame, std::string* error) {
   std::optional<LumoMessage> message =
       decodeLumoFrame(std::move(frame), limits_, &makeEndpoint, error);
-  if (!message) SystemLog(kLumoError, "-[LumoConnection decode]", *error);
+  if (!message) peerError("-[LumoConnection decode]", *error);
   return message;
 }
 
@@ -322,7 +323,7 @@ void LumoConnection::handleInvoke(LumoRawFrame frame) {
         std::string sendError;
         LumoMessage answer{LumoMessage::Kind::Reply, id, "", std::move(values)};
         if (!connection->send(answer, &sendError)) {
-          SystemLog(kLumoError, "-[LumoConnection reply]", sendError);
+          connection->peerError("-[LumoConnection reply]", sendError);
         }
       });
     };
@@ -336,7 +337,7 @@ void LumoConnection::handleInvoke(LumoRawFrame frame) {
 }
 
 void LumoConnection::refuse(const LumoMessage& message, const std::string& why) {
-  SystemLog(kLumoError, "-[LumoConnection dispatch]", why);
+  peerError("-[LumoConnection dispatch]", why);
   if (message.id == 0) return;
   std::string error;
   send(LumoMessage{LumoMessage::Kind::Error, message.id, why, {}}, &error);
@@ -348,7 +349,7 @@ void LumoConnection::refuseOnce(const std::string& why) {
     if (refusalLogged_) return;
     refusalLogged_ = true;
   }
-  SystemLog(kLumoError, "-[LumoConnection read]", why);
+  peerError("-[LumoConnection read]", why);
 }
 
 }  // namespace typhora

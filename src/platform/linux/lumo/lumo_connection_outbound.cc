@@ -17,7 +17,7 @@
 
 namespace typhora {
 
-using lumo_detail::kLumoError;
+using lumo_detail::kPeerClosed;
 
 namespace {
 
@@ -47,7 +47,8 @@ bool LumoConnection::send(const LumoMessage& message, std::string* error) {
   }
   if (cutOff) {
     if (error->empty()) *error = "the peer stopped reading; cut off";
-    SystemLog(kLumoError, "-[LumoConnection send]", *error);
+    // A peer that has gone is the connection's ordinary end, not worth a line.
+    if (*error != kPeerClosed) peerError("-[LumoConnection send]", *error);
     end(*error, false);
     return false;
   }
@@ -94,7 +95,7 @@ bool LumoConnection::flushLocked(std::string* error) {
     if (n < 0 && errno == EINTR) continue;
     if (n < 0 && (errno == EAGAIN || errno == EWOULDBLOCK)) break;
     if (n < 0) {
-      *error = std::strerror(errno);
+      *error = errno == EPIPE || errno == ECONNRESET ? kPeerClosed : std::strerror(errno);
       return false;
     }
     front.fds.clear();  // the descriptors went with the first byte
@@ -129,7 +130,7 @@ void LumoConnection::watchForStall(std::size_t sentBefore) {
       if (self->outboundSent_ != sentBefore) return self->watchForStall(self->outboundSent_);
     }
     const std::string why = "the peer stopped reading; cut off";
-    SystemLog(kLumoError, "-[LumoConnection send]", why);
+    self->peerError("-[LumoConnection send]", why);
     self->end(why, false);
   });
 }

@@ -34,7 +34,8 @@ struct LumoConnection::Outgoing {
 
 namespace lumo_detail {
 
-inline constexpr const char* kLumoError = "lumo error: %s - %@";
+// Why a connection ended when its peer closed its end or went away.
+inline constexpr const char* kPeerClosed = "the peer closed the connection";
 
 // Completes a pending call with its raw answer (or an error) and wakes a synchronous caller.
 inline void finish(const std::shared_ptr<LumoConnection::Pending>& p,
