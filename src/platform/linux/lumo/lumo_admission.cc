@@ -15,6 +15,7 @@ LumoAdmission& LumoAdmission::shared() {
 void LumoAdmission::setLimits(const LumoAdmissionLimits& limits) {
   std::lock_guard lock(mutex_);
   limits_ = limits;
+  outboundLimit_ = limits.outboundBytes;
 }
 
 LumoAdmissionLimits LumoAdmission::limits() const {

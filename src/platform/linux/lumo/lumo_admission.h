@@ -29,6 +29,8 @@ struct LumoAdmissionLimits {
   std::size_t unidentified = 64;  // accepted, handshake not finished
   std::size_t inboundBytes = 128u << 20;
   std::size_t descriptorsPerConnection = 64;
+  // Answers queued for peers across connections; past it, peers that stopped reading are cut off.
+  std::size_t outboundBytes = 256u << 20;
 };
 
 class LumoAdmission {
@@ -64,6 +66,12 @@ class LumoAdmission {
   // Inbound bytes buffered across connections.
   void addInbound(std::ptrdiff_t delta) { inbound_.fetch_add(delta, std::memory_order_relaxed); }
   bool inboundOverLimit() const;
+  // Outbound bytes queued across connections, and whether `extra` more would pass the bound.
+  void addOutbound(std::ptrdiff_t delta) { outbound_.fetch_add(delta, std::memory_order_relaxed); }
+  bool outboundOverLimit(std::size_t extra) const {
+    return outbound_.load(std::memory_order_relaxed) + static_cast<std::ptrdiff_t>(extra) >
+           static_cast<std::ptrdiff_t>(outboundLimit_.load(std::memory_order_relaxed));
+  }
 
   // Logs `message` for `uid` once, until clearLogged(kind, uid) and at most once a minute.
   void logOnce(const char* kind, uid_t uid, const std::string& message);
@@ -94,6 +102,8 @@ class LumoAdmission {
   static constexpr auto kRelogInterval = std::chrono::seconds(60);
   std::map<std::pair<std::string, uid_t>, LoggedLimit> logged_;
   std::atomic<std::ptrdiff_t> inbound_{0};
+  std::atomic<std::ptrdiff_t> outbound_{0};
+  std::atomic<std::size_t> outboundLimit_{LumoAdmissionLimits{}.outboundBytes};  // read per send
 };
 
 }  // namespace typhora

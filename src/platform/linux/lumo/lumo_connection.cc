@@ -252,6 +252,7 @@ void LumoConnection::end(const std::string& reason, bool peerWentAway) {
     droppedOutbound_ = !outbound_.empty();
     outbound_.clear();
     sent_.notify_all();
+    LumoAdmission::shared().addOutbound(-static_cast<std::ptrdiff_t>(outboundBytes_));
     outboundBytes_ = 0;
     updateInboundLocked();
     wasAdmitted = std::exchange(admitted_, false);

@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <cstring>
 
+#include "platform/linux/lumo/lumo_admission.h"
 #include "platform/linux/lumo/lumo_connection.h"
 #include "platform/linux/lumo/lumo_connection_parts.h"
 #include "platform/linux/lumo/lumo_endpoint.h"
@@ -56,8 +57,18 @@ bool LumoConnection::send(const LumoMessage& message, std::string* error) {
 }
 
 bool LumoConnection::enqueueLocked(std::unique_ptr<Outgoing> out, bool first, std::string* error) {
-  if (outboundBytes_ + out->bytes.size() > kOutboundLimit) return false;
-  outboundBytes_ += out->bytes.size();
+  const std::size_t size = out->bytes.size();
+  if (outboundBytes_ + size > kOutboundLimit) return false;
+  // Many peers that do not read could each pile answers up to the connection's limit: past the
+  // process's bound, one whose pile this answer would grow is cut off rather than given more. A
+  // peer with nothing waiting always gets its answer, however large.
+  const bool piles = !outbound_.empty() && outboundBytes_ + size > kPiledAnswersBytes;
+  if (piles && LumoAdmission::shared().outboundOverLimit(size)) {
+    *error = "answers waiting for peers over their bound; cut off";
+    return false;
+  }
+  outboundBytes_ += size;
+  LumoAdmission::shared().addOutbound(static_cast<std::ptrdiff_t>(size));
   const bool piledNow = !answersPiled_ && outboundBytes_ > kPiledAnswersBytes;
   if (piledNow) {
     answersPiled_ = true;
@@ -103,6 +114,7 @@ bool LumoConnection::flushLocked(std::string* error) {
     outboundSent_ += static_cast<std::size_t>(n);
     if (front.offset == front.bytes.size()) {
       outboundBytes_ -= front.bytes.size();
+      LumoAdmission::shared().addOutbound(-static_cast<std::ptrdiff_t>(front.bytes.size()));
       outbound_.pop_front();
     }
   }

@@ -5,7 +5,7 @@
 //                          and answers with what its echo:reply: says
 //   forward DIR            asks "test.a" for an endpoint and hands it to "test.c"
 //   exec-after-call DIR    calls echo:reply:, then becomes /bin/sleep
-//   flood DIR              sends large calls on a raw socket and never reads the answers
+//   flood DIR [BYTES]      sends calls of BYTES (1 MiB) on a raw socket, never reading answers
 //   garbage DIR            sends bytes that are no frame, then a valid call
 //   notes DIR N            N times: connects, sends the one-way note: and closes at once
 #include <sys/socket.h>
@@ -142,8 +142,9 @@ int main(int argc, char** argv) {
   }
   if (mode == "flood") {
     int fd = rawConnect(dir);
-    auto frame = raw::frameOf("echo:reply:", {Value(std::string(1 << 20, 'f'))}, 1);
-    for (int i = 0; i < 200; ++i) {
+    const std::size_t bytes = argc > 3 ? std::stoul(argv[3]) : 1u << 20;
+    auto frame = raw::frameOf("echo:reply:", {Value(std::string(bytes, 'f'))}, 1);
+    for (std::size_t sent = 0; sent < 200u << 20; sent += frame.size()) {
       if (send(fd, frame.data(), frame.size(), MSG_NOSIGNAL) < 0) break;
     }
     std::cout << "flooded" << std::endl;

@@ -173,6 +173,23 @@ TEST_F(LumoTest, APeerThatStopsReadingIsCutOffWhileOthersAreAnswered) {
   EXPECT_TRUE(log.contains("the peer stopped reading; cut off")) << flood.output();
 }
 
+TEST_F(LumoTest, AnswersPiledForPeersThatDoNotReadAreBoundedAcrossConnections) {
+  LumoAdmissionLimits limits;
+  limits.outboundBytes = 512u << 10;  // half of what one peer may pile before its reads pause
+  LumoAdmission::shared().setLimits(limits);
+  testing::LogCapture log;
+  ChildProcess flood(peer({"flood", "65536"}));
+  for (int i = 0; i < 1000 && !log.contains("over their bound"); ++i) {
+    std::this_thread::sleep_for(10ms);
+  }
+  EXPECT_TRUE(log.contains("answers waiting for peers over their bound; cut off"))
+      << flood.output();
+  EXPECT_FALSE(log.contains("the peer stopped reading")) << "cut off by the stall, not the bound";
+  auto r = runCommand(peer({"call", "count:reply:", "1"}), 30s);
+  EXPECT_EQ(r.out, "[2]\n") << r.all;
+  LumoAdmission::shared().setLimits({});
+}
+
 TEST_F(LumoTest, AThousandSimultaneousConnectionsAreServed) {
   rlimit limit{};
   getrlimit(RLIMIT_NOFILE, &limit);
