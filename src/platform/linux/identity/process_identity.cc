@@ -7,73 +7,112 @@
 
 #include <cerrno>
 #include <charconv>
-#include <sstream>
 
 #include "platform/fd/unique_fd.h"
 
 namespace typhora {
 namespace {
 
-std::optional<std::uint64_t> startTimeOf(pid_t pid) {
-  std::optional<std::string> content = ProcessIdentity::readProcessFile(pid, "stat");
-  if (!content) return std::nullopt;
-  // The command name may hold spaces and parentheses: fields start after the last ')'.
-  std::size_t close = content->rfind(')');
-  if (close == std::string::npos || close + 2 > content->size()) return std::nullopt;
-  std::istringstream fields(content->substr(close + 2));
-  std::string field;
-  // Field 3 (state) is the first after the name; the start time is field 22.
-  for (int index = 3; fields >> field; ++index) {
-    if (index != 22) continue;
+// A process's /proc directory, opened once: every file read through it belongs to that process
+// instance. Once the process has ended, reads through it fail, even if its pid names another
+// process by then, so what is read through one directory never mixes two processes.
+class ProcDirectory {
+ public:
+  explicit ProcDirectory(pid_t pid)
+      : fd_(pid > 0
+                ? open(("/proc/" + std::to_string(pid)).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC)
+                : -1) {}
+
+  bool valid() const { return fd_.valid(); }
+
+  std::optional<std::string> read(const char* name) const {
+    // Plain reads: a process that ends while its file is read makes the read fail (ESRCH), which
+    // must be an answer here, never an exception.
+    UniqueFd file(openat(fd_.get(), name, O_RDONLY | O_CLOEXEC));
+    if (!file.valid()) return std::nullopt;
+    std::string content;
+    char buffer[4096];
+    for (;;) {
+      ssize_t n = ::read(file.get(), buffer, sizeof buffer);
+      if (n < 0 && errno == EINTR) continue;
+      if (n < 0) return std::nullopt;
+      if (n == 0) return content;
+      content.append(buffer, static_cast<std::size_t>(n));
+    }
+  }
+
+  // Field 22 of stat, the start time in clock ticks since boot.
+  std::optional<std::uint64_t> startTime() const {
+    std::optional<std::string> stat = read("stat");
+    if (!stat) return std::nullopt;
+    // The command name may hold spaces and parentheses: fields start after the last ')'.
+    std::size_t at = stat->rfind(')');
+    if (at == std::string::npos) return std::nullopt;
+    at += 2;  // the state, field 3
+    for (int field = 3; field < 22; ++field) {
+      at = stat->find(' ', at);
+      if (at == std::string::npos) return std::nullopt;
+      ++at;
+    }
+    const char* first = stat->data() + at;
+    const char* last = stat->data() + stat->size();
     std::uint64_t start = 0;
-    auto [end, error] = std::from_chars(field.data(), field.data() + field.size(), start);
-    if (error != std::errc() || end != field.data() + field.size()) return std::nullopt;
+    auto [end, error] = std::from_chars(first, last, start);
+    if (error != std::errc() || end == first || (end != last && *end != ' ')) return std::nullopt;
     return start;
   }
-  return std::nullopt;
-}
 
-bool executableOf(pid_t pid, std::uint64_t* device, std::uint64_t* inode) {
-  struct stat info {};
-  if (stat(("/proc/" + std::to_string(pid) + "/exe").c_str(), &info) != 0) return false;
-  *device = info.st_dev;
-  *inode = info.st_ino;
-  return true;
-}
+  bool executable(std::uint64_t* device, std::uint64_t* inode) const {
+    struct stat info {};
+    if (fstatat(fd_.get(), "exe", &info, 0) != 0) return false;
+    *device = info.st_dev;
+    *inode = info.st_ino;
+    return true;
+  }
+
+  bool runs(const AuditToken& token) const {
+    std::uint64_t device = 0;
+    std::uint64_t inode = 0;
+    return executable(&device, &inode) && device == token.exeDevice && inode == token.exeInode;
+  }
+
+  // The directory opened by pid names the token's process: the pid was not reused.
+  bool isOf(const AuditToken& token) const { return valid() && startTime() == token.startTime; }
+
+  std::optional<std::string> executablePath() const {
+    char buffer[4096];
+    ssize_t n = readlinkat(fd_.get(), "exe", buffer, sizeof buffer - 1);
+    if (n <= 0) return std::nullopt;
+    return std::string(buffer, static_cast<std::size_t>(n));
+  }
+
+ private:
+  UniqueFd fd_;
+};
 
 }  // namespace
 
 std::optional<std::uint64_t> ProcessIdentity::startTime(pid_t pid) {
-  return startTimeOf(pid);
+  ProcDirectory process(pid);
+  return process.valid() ? process.startTime() : std::nullopt;
 }
 
 std::optional<std::string> ProcessIdentity::readProcessFile(pid_t pid, const char* name) {
-  // Plain reads: a process that ends while its file is read makes the read fail (ESRCH), which
-  // must be an answer here, never an exception.
-  UniqueFd fd(open(("/proc/" + std::to_string(pid) + "/" + name).c_str(), O_RDONLY | O_CLOEXEC));
-  if (!fd.valid()) return std::nullopt;
-  std::string content;
-  char buffer[4096];
-  for (;;) {
-    ssize_t n = read(fd.get(), buffer, sizeof buffer);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) return std::nullopt;
-    if (n == 0) return content;
-    content.append(buffer, static_cast<std::size_t>(n));
-  }
+  ProcDirectory process(pid);
+  return process.valid() ? process.read(name) : std::nullopt;
 }
 
 AuditToken ProcessIdentity::ofProcess(pid_t pid, uid_t uid, gid_t gid) {
+  ProcDirectory process(pid);
+  if (!process.valid()) return AuditToken{};
+  std::optional<std::uint64_t> start = process.startTime();
   AuditToken token;
-  auto start = pid > 0 ? startTimeOf(pid) : std::nullopt;
   if (!start) return token;
   token.pid = pid;
   token.uid = uid;
   token.gid = gid;
   token.startTime = *start;
-  if (!executableOf(pid, &token.exeDevice, &token.exeInode)) return AuditToken{};
-  // The process may have gone and its pid been reused between the two reads.
-  if (startTimeOf(pid) != start) return AuditToken{};
+  if (!process.executable(&token.exeDevice, &token.exeInode)) return AuditToken{};
   return token;
 }
 
@@ -88,21 +127,18 @@ AuditToken ProcessIdentity::ofSocketPeer(int fd) {
 
 bool ProcessIdentity::isValid(const AuditToken& token) {
   if (token.isZero()) return false;
-  if (startTimeOf(token.pid) != token.startTime) return false;
-  std::uint64_t device = 0;
-  std::uint64_t inode = 0;
-  if (!executableOf(token.pid, &device, &inode)) return false;
-  return device == token.exeDevice && inode == token.exeInode &&
-         startTimeOf(token.pid) == token.startTime;
+  ProcDirectory process(token.pid);
+  return process.isOf(token) && process.runs(token);
 }
 
 std::optional<std::string> ProcessIdentity::executablePath(const AuditToken& token) {
-  if (!isValid(token)) return std::nullopt;
-  char buffer[4096];
-  ssize_t n =
-      readlink(("/proc/" + std::to_string(token.pid) + "/exe").c_str(), buffer, sizeof buffer - 1);
-  if (n <= 0 || !isValid(token)) return std::nullopt;
-  return std::string(buffer, static_cast<std::size_t>(n));
+  if (token.isZero()) return std::nullopt;
+  ProcDirectory process(token.pid);
+  if (!process.isOf(token) || !process.runs(token)) return std::nullopt;
+  std::optional<std::string> path = process.executablePath();
+  // An exec between the two looks would name the new program.
+  if (!path || !process.runs(token)) return std::nullopt;
+  return path;
 }
 
 }  // namespace typhora
