@@ -59,7 +59,9 @@ void LumoListener::invalidate() {
 }
 
 void LumoListener::onReadable() {
-  for (;;) {
+  // A storm of connections must not hold the I/O thread from the connections it already serves:
+  // a few accepts a turn, then the socket waits for the loop's next turn (it stays readable).
+  for (int turn = 0; turn < kAcceptsPerTurn; ++turn) {
     if (!LumoAdmission::shared().mayAccept([weak = weak_from_this()] {
           if (auto self = weak.lock()) self->resumeListening();
         })) {
@@ -141,9 +143,16 @@ void LumoListener::resumeListening() {
 }
 
 bool LumoListener::offer(UniqueFd fd) {
+  // The user's cap first, from the kernel's credentials alone: a peer over it costs no reading
+  // of its process.
+  ucred cred{};
+  socklen_t length = sizeof cred;
+  if (getsockopt(fd.get(), SOL_SOCKET, SO_PEERCRED, &cred, &length) != 0) return true;
+  if (!LumoAdmission::shared().admit(cred.uid)) return true;
   int error = 0;
   ProcessPin peer = ProcessPin::ofSocketPeer(fd.get(), &error);
   if (error == EMFILE || error == ENFILE) {
+    LumoAdmission::shared().release(cred.uid);
     backOff(std::strerror(error));
     return false;
   }
@@ -151,8 +160,10 @@ bool LumoListener::offer(UniqueFd fd) {
     std::lock_guard lock(mutex_);
     backingOff_ = false;
   }
-  if (!peer.pinned()) return true;  // gone, or not identifiable: nothing may speak for it
-  if (!LumoAdmission::shared().admit(peer.token().uid)) return true;
+  if (!peer.pinned() || peer.token().uid != cred.uid) {
+    LumoAdmission::shared().release(cred.uid);
+    return true;  // gone, or not identifiable: nothing may speak for it
+  }
   const uid_t uid = peer.token().uid;
   auto connection = LumoConnection::adopt(std::move(fd), std::move(peer));
   LumoAdmission::shared().awaitHello(uid, connection);

@@ -28,6 +28,7 @@ class LumoListener final : public IpcListener, public std::enable_shared_from_th
  private:
   LumoListener() = default;
   static constexpr auto kBackOff = std::chrono::milliseconds(100);
+  static constexpr int kAcceptsPerTurn = 16;
 
   void onReadable();
   void backOff(const std::string& why);
