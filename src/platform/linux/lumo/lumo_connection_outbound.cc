@@ -26,6 +26,9 @@ namespace {
 // gets no more work done for it (the kernel holds its calls), and is cut off once they have not
 // moved for kStalledPeerLimit.
 constexpr std::size_t kPiledAnswersBytes = 1u << 20;
+// Or this many messages: a megabyte of small answers is tens of thousands of calls served for a
+// peer that takes none of them.
+constexpr std::size_t kPiledAnswers = 256;
 constexpr auto kStalledPeerLimit = std::chrono::seconds(5);
 
 }  // namespace
@@ -69,7 +72,8 @@ bool LumoConnection::enqueueLocked(std::unique_ptr<Outgoing> out, bool first, st
   }
   outboundBytes_ += size;
   LumoAdmission::shared().addOutbound(static_cast<std::ptrdiff_t>(size));
-  const bool piledNow = !answersPiled_ && outboundBytes_ > kPiledAnswersBytes;
+  const bool piledNow = !answersPiled_ && (outboundBytes_ > kPiledAnswersBytes ||
+                                           outbound_.size() + 1 > kPiledAnswers);
   if (piledNow) {
     answersPiled_ = true;
     updateInterestLocked();
@@ -120,7 +124,8 @@ bool LumoConnection::flushLocked(std::string* error) {
   }
   const bool wantWrites = !outbound_.empty() && !held;
   if (outbound_.empty()) sent_.notify_all();
-  if (answersPiled_ && outboundBytes_ <= kPiledAnswersBytes / 2) {
+  if (answersPiled_ && outboundBytes_ <= kPiledAnswersBytes / 2 &&
+      outbound_.size() <= kPiledAnswers / 2) {
     answersPiled_ = false;
     updateInterestLocked();
   }
