@@ -149,6 +149,41 @@ struct OpenOptions {
   std::string token;
 };
 
+void openDirectly(const std::string& root, const std::string& path) {
+  const int fd = ::open(DeviceRoot(root).onDisk(path).c_str(), O_RDONLY | O_CLOEXEC);
+  const int error = fd >= 0 ? 0 : errno;
+  if (fd >= 0) ::close(fd);
+  std::cout << JsonCodec::encode(Value::dictionary({{"via", "direct"},
+                                                    {"path", path},
+                                                    {"errno", static_cast<std::int64_t>(error)}}))
+            << std::endl;
+}
+
+// `token` altered in this process (its path, its MAC), and used by forked children.
+void misuse(const SandboxExtensionClient& client, const std::string& token,
+            const OpenOptions& open) {
+  const std::size_t pathStart = token.size() - pathOf(token).size();
+  if (!open.alter.empty()) {
+    const std::string altered = token.substr(0, pathStart) + open.alter;
+    print("altered", altered, client.open(altered), open.read);
+  }
+  if (open.forge) {
+    // The MAC is the field before the path.
+    const std::size_t macStart = token.rfind(';', pathStart - 2) + 1;
+    std::string forged = token;
+    forged.replace(macStart, pathStart - 1 - macStart, pathStart - 1 - macStart, '0');
+    print("forged", forged, client.open(forged), open.read);
+  }
+  if (open.child) inChild([&] { print("child", token, client.open(token), open.read); });
+  if (open.handed) {
+    std::string error;
+    UniqueFd socket = client.connect(&error);
+    inChild([&] {
+      print("handed", token, SandboxExtensionClient::exchange(socket.get(), token), open.read);
+    });
+  }
+}
+
 int checkedIn(const ClientOptions& options, const std::string& root, const OpenOptions& open) {
   ServiceSession session(options, typhoraDaemonProtocol());
   CallResult checkin = session.call(op::kCheckin, {});
@@ -163,41 +198,11 @@ int checkedIn(const ClientOptions& options, const std::string& root, const OpenO
             << std::endl;
   const SandboxExtensionClient client(options.runtimeDir);
   for (const Token& token : tokens) {
-    if (open.direct) {
-      const int fd = ::open(DeviceRoot(root).onDisk(token.path).c_str(), O_RDONLY | O_CLOEXEC);
-      const int error = errno;
-      std::cout << JsonCodec::encode(Value::dictionary(
-                       {{"via", "direct"},
-                        {"path", token.path},
-                        {"errno", static_cast<std::int64_t>(fd >= 0 ? 0 : error)}}))
-                << std::endl;
-      if (fd >= 0) ::close(fd);
-    }
+    if (open.direct) openDirectly(root, token.path);
     print("token", token.text, client.open(token.text), open.read);
   }
   for (const std::string& text : open.also) print("also", text, client.open(text), open.read);
-  if (tokens.empty()) return 0;
-  const std::string& first = tokens.front().text;
-  if (!open.alter.empty()) {
-    const std::string altered = first.substr(0, first.size() - pathOf(first).size()) + open.alter;
-    print("altered", altered, client.open(altered), open.read);
-  }
-  if (open.forge) {
-    // The MAC is the field before the path.
-    const std::size_t end = first.size() - pathOf(first).size() - 1;
-    const std::size_t start = first.rfind(';', end - 1) + 1;
-    std::string forged = first;
-    forged.replace(start, end - start, std::string(end - start, '0'));
-    print("forged", forged, client.open(forged), open.read);
-  }
-  if (open.child) inChild([&] { print("child", first, client.open(first), open.read); });
-  if (open.handed) {
-    std::string error;
-    UniqueFd socket = client.connect(&error);
-    inChild([&] {
-      print("handed", first, SandboxExtensionClient::exchange(socket.get(), first), open.read);
-    });
-  }
+  if (!tokens.empty()) misuse(client, tokens.front().text, open);
   return 0;
 }
 

@@ -182,7 +182,9 @@ void SandboxExtensionServer::serve(int fd) {
   const std::optional<ucred> writer = takeCredentials(&message);
   if ((message.msg_flags & (MSG_TRUNC | MSG_CTRUNC)) != 0) {
     refusal = "message too long";
-  } else if (!writer || !connection.pin.pinned() || writer->pid != connection.pin.token().pid ||
+  } else if (!connection.pin.pinned()) {
+    refusal = "the connecting process cannot be identified";
+  } else if (!writer || writer->pid != connection.pin.token().pid ||
              writer->uid != connection.pin.token().uid) {
     refusal = "the message was not written by the process that connected";
   }
