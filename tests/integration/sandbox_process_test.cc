@@ -4,7 +4,11 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/time.h>
+
+#include <cstring>
 
 #include <map>
 #include <sstream>
@@ -158,15 +162,18 @@ TEST_F(SandboxProcessTest, TheSandboxSocketTakesHostilePeersInStride) {
     EXPECT_TRUE(fd.valid()) << failure;
     return SandboxExtensionClient::exchange(fd.get(), message, 5).error;
   };
+  // A peer that says nothing is cut off (after 5 s) while the others are answered.
+  std::string failure;
+  UniqueFd quiet = client.connect(&failure);
+  ASSERT_TRUE(quiet.valid()) << failure;
   EXPECT_EQ(exchange(std::string(64 * 1024, 'x')), "message too long");
   EXPECT_EQ(exchange(std::string("1;2\0;3", 6)), "malformed token");
   EXPECT_THAT(exchange("not a token"), HasSubstr("not issued to this process"));
 
-  // Silent connections up to this user's cap: the next one is closed at once, and once they
-  // have gone, exchanges are answered again.
+  // Silent connections up to this user's cap (16, the quiet one among them): the next one is
+  // closed at once, and once they have gone, exchanges are answered again.
   std::vector<UniqueFd> silent;
-  std::string failure;
-  for (int i = 0; i < 16; ++i) silent.push_back(client.connect(&failure));
+  for (int i = 0; i < 15; ++i) silent.push_back(client.connect(&failure));
   EXPECT_THAT(exchange("not a token"),
               AnyOf(HasSubstr("closed the connection"), HasSubstr("reset by peer")));
   silent.clear();
@@ -176,6 +183,10 @@ TEST_F(SandboxProcessTest, TheSandboxSocketTakesHostilePeersInStride) {
     if (!answered) std::this_thread::sleep_for(20ms);
   }
   EXPECT_TRUE(answered);
+  timeval patience{10, 0};
+  setsockopt(quiet.get(), SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof patience);
+  char byte = 0;
+  EXPECT_EQ(recv(quiet.get(), &byte, 1, 0), 0) << std::strerror(errno);
   EXPECT_EQ(ctl({"call", "checkin:"}).status, 0);
 }
 

@@ -25,7 +25,7 @@ constexpr auto kTick = std::chrono::milliseconds(100);
 // Out of descriptors: accepting waits this long before it tries again.
 constexpr auto kAcceptBackoff = std::chrono::milliseconds(100);
 
-void send(int fd, const std::string& text, int descriptor) {
+void sendAnswer(int fd, const std::string& text, int descriptor) {
   iovec part{const_cast<char*>(text.data()), text.size()};
   msghdr message{};
   message.msg_iov = &part;
@@ -192,7 +192,7 @@ void SandboxExtensionServer::serve(int fd) {
   const std::string answer = refusal.empty() ? exchange(connection, std::move(token), &opened)
                                              : sandboxexchange::kRefused + refusal;
   if (!opened.valid()) refuse(connection, answer);
-  send(fd, answer, opened.get());
+  sendAnswer(fd, answer, opened.get());
   close(fd);
 }
 
