@@ -115,15 +115,15 @@ void SandboxExtensionServer::acceptAll() {
       }
       return;
     }
-    Connection connection;
-    connection.pin = ProcessPin::ofSocketPeer(fd.get());
     ucred cred{};
     socklen_t length = sizeof cred;
     getsockopt(fd.get(), SOL_SOCKET, SO_PEERCRED, &cred, &length);
-    connection.uid = cred.uid;
     std::size_t& held = perUser_[cred.uid];
     if (held >= limits_.connectionsPerUser) continue;  // closed: this user holds enough open
     ++held;
+    Connection connection;
+    connection.uid = cred.uid;
+    connection.pin = ProcessPin::ofSocketPeer(fd.get());
     connection.deadline = Clock::now() + limits_.silentPeer;
     epoll_event event{};
     event.events = EPOLLIN;
@@ -172,7 +172,8 @@ void SandboxExtensionServer::serve(int fd) {
   message.msg_controllen = control.size();
   const ssize_t n = recvmsg(fd, &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
   if (n < 0 && (errno == EAGAIN || errno == EINTR)) return;
-  takeDescriptors(&message);  // closed: the exchange takes none
+  // Closed: the exchange takes none (an empty message may carry some too).
+  if (n >= 0) takeDescriptors(&message);
   if (n <= 0) {
     close(fd);
     return;
