@@ -23,7 +23,8 @@ fail() { echo "package.sh: $*" >&2; exit 1; }
 listing=$(dpkg-deb -c "$deb")
 for path in ./usr/bin/typhorad ./usr/bin/typhoractl \
   ./usr/lib/systemd/system/typhorad.service ./usr/lib/systemd/system/typhorad.socket \
-  ./usr/lib/systemd/system/typhorad-events.socket ./usr/lib/sysusers.d/typhora.conf \
+  ./usr/lib/systemd/system/typhorad-events.socket ./usr/lib/systemd/system/typhorad-sandbox.socket \
+  ./usr/lib/sysusers.d/typhora.conf \
   ./usr/lib/tmpfiles.d/typhora.conf ./usr/share/typhora/etc/typhora/typhorad.launch.plist \
   ./usr/share/man/man8/typhorad.8 ./usr/share/man/man1/typhoractl.1 \
   ./usr/share/bash-completion/completions/typhoractl; do
@@ -46,6 +47,6 @@ bash -n "$unpacked/usr/share/bash-completion/completions/typhoractl"
 units="$unpacked/usr/lib/systemd/system"
 sed -i "s|/usr/bin/typhorad|$unpacked/usr/bin/typhorad|" "$units/typhorad.service"
 (cd "$units" && SYSTEMD_LOG_LEVEL=notice systemd-analyze verify --man=no \
-  typhorad.socket typhorad-events.socket typhorad.service) || fail "systemd-analyze verify failed"
+  typhorad.socket typhorad-events.socket typhorad-sandbox.socket typhorad.service) || fail "systemd-analyze verify failed"
 echo "package.sh: $(dpkg-deb -f "$deb" Package) $(dpkg-deb -f "$deb" Version) checked"
 echo "$deb"

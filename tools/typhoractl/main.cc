@@ -15,6 +15,7 @@
 #include "load_command.h"
 #include "plist_command.h"
 #include "request_fonts_command.h"
+#include "sandbox_command.h"
 #include "status_command.h"
 #include "view_service_command.h"
 #include "web_content_command.h"
@@ -43,6 +44,8 @@ constexpr const char* kUsage =
     "  client [--watch]      check in as an application; --watch prints font changes\n"
     "  status [--table|--metrics]   the daemon's state (event socket: root or its user)\n"
     "  grants [APP] [--table]       the fonts issued to each application\n"
+    "  sandbox-exec [--root DIR] -- PROGRAM ARGS...   run an application in its sandbox\n"
+    "  sandbox-open TOKEN [--read]  exchange a sandbox token for a descriptor\n"
     "\n"
     "  --runtime-dir DIR     where the daemon's socket is (default $TYPHORA_RUNTIME_DIR,\n"
     "                        else /run/typhora)\n"
@@ -105,6 +108,8 @@ int main(int argc, char** argv) {
   if (args[0] == "pick") return typhora::ctl::runPickCommand(options, rest);
   if (args[0] == "font-names") return typhora::ctl::runFontNamesCommand(rest);
   if (args[0] == "font") return typhora::ctl::runFontCommand(options, root, rest);
+  if (args[0] == "sandbox-exec") return typhora::ctl::runSandboxExecCommand(root, rest);
+  if (args[0] == "sandbox-open") return typhora::ctl::runSandboxOpenCommand(options, root, rest);
   if (args[0] == "status") return typhora::ctl::runStatusCommand(options, rest);
   if (args[0] == "grants") return typhora::ctl::runGrantsCommand(options, rest);
   if (args[0] == "activity")

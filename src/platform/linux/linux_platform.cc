@@ -12,6 +12,7 @@ LinuxPlatform::LinuxPlatform(const std::string& root, const std::string& runtime
       manifests_(root),
       codeSigning_(manifests_),
       sandbox_(root, manifests_),
+      sandboxExchange_(root, runtimeDir, sandbox_),
       appRegistry_(manifests_),
       appStates_(root),
       analytics_(root, Clock::system()),
@@ -35,7 +36,7 @@ LinuxPlatform::LinuxPlatform(const std::string& root, const std::string& runtime
 }
 
 bool LinuxPlatform::startServices() {
-  return eventHub_->start();
+  return eventHub_->start() && sandboxExchange_.start();
 }
 
 }  // namespace typhora

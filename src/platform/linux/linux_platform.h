@@ -23,6 +23,7 @@
 #include "platform/linux/identity/linux_code_signing_query.h"
 #include "platform/linux/lumo/lumo_service.h"
 #include "platform/linux/sandbox/linux_sandbox_broker.h"
+#include "platform/linux/sandbox/sandbox_extension_server.h"
 #include "platform/platform.h"
 
 namespace typhora {
@@ -31,7 +32,8 @@ class LinuxPlatform {
  public:
   LinuxPlatform(const std::string& root, const std::string& runtimeDir);
   Platform& bundle() { return bundle_; }
-  // Opens the platform's own sockets (the event socket); false when one cannot be opened.
+  // Opens the platform's own sockets (the event socket, the sandbox socket); false when one cannot
+  // be opened.
   bool startServices();
   // What the event socket's introspection operations answer.
   void setReporter(LinuxEventHub::Reporter reporter) {
@@ -46,6 +48,7 @@ class LinuxPlatform {
   AppManifestStore manifests_;
   LinuxCodeSigningQuery codeSigning_;
   LinuxSandboxBroker sandbox_;
+  SandboxExtensionServer sandboxExchange_;
   LinuxAppRegistry appRegistry_;
   LinuxAppStateMonitor appStates_;
   LinuxAnalyticsSink analytics_;

@@ -106,17 +106,21 @@ std::optional<std::string> AppManifestStore::digestOfProgram(const AuditToken& t
   std::optional<ProgramKey> key = fd.valid() ? programKey(fd.get()) : std::nullopt;
   if (!key || std::get<0>(*key) != token.exeDevice || std::get<1>(*key) != token.exeInode)
     return std::nullopt;
+  return digestOfFile(fd.get(), *key);
+}
+
+std::optional<std::string> AppManifestStore::digestOfFile(int fd, const ProgramKey& key) const {
   {
     std::lock_guard lock(mutex_);
-    if (auto it = digests_.find(*key); it != digests_.end()) return it->second;
+    if (auto it = digests_.find(key); it != digests_.end()) return it->second;
   }
-  std::optional<std::string> digest = sha256Hex(fd.get());
+  std::optional<std::string> digest = sha256Hex(fd);
   if (!digest) return std::nullopt;
   // A file changed while it was hashed gives a digest of neither version: not kept.
-  if (programKey(fd.get()) != key) return std::nullopt;
+  if (programKey(fd) != key) return std::nullopt;
   std::lock_guard lock(mutex_);
   if (digests_.size() >= kMaxCachedDigests) digests_.clear();
-  digests_[*key] = *digest;
+  digests_[key] = *digest;
   return digest;
 }
 
@@ -129,6 +133,20 @@ std::optional<AppManifest> AppManifestStore::manifestForProcess(const AuditToken
   std::optional<std::string> digest = digestOfProgram(token);
   // The pid may have been reused while the program was opened.
   if (!digest || !ProcessIdentity::isValid(token)) return std::nullopt;
+  for (const AppManifest& manifest : *manifests) {
+    if (named(manifest) && manifest.sha256 == *digest) return manifest;
+  }
+  return std::nullopt;
+}
+
+std::optional<AppManifest> AppManifestStore::manifestForProgram(const std::string& path,
+                                                                int fd) const {
+  auto manifests = current();
+  auto named = [&](const AppManifest& m) { return m.executable == path; };
+  if (std::none_of(manifests->begin(), manifests->end(), named)) return std::nullopt;
+  std::optional<ProgramKey> key = programKey(fd);
+  std::optional<std::string> digest = key ? digestOfFile(fd, *key) : std::nullopt;
+  if (!digest) return std::nullopt;
   for (const AppManifest& manifest : *manifests) {
     if (named(manifest) && manifest.sha256 == *digest) return manifest;
   }

@@ -27,6 +27,9 @@ class AppManifestStore {
   explicit AppManifestStore(const std::string& root);
 
   std::optional<AppManifest> manifestForProcess(const AuditToken& token) const;
+  // The manifest of the program at machine path `path`, open as `fd` (read from its start): the
+  // manifest's executable is `path` and the file's bytes hash to its SHA-256.
+  std::optional<AppManifest> manifestForProgram(const std::string& path, int fd) const;
   std::optional<AppManifest> manifestForIdentifier(const std::string& identifier) const;
 
  private:
@@ -43,6 +46,7 @@ class AppManifestStore {
   // file can set its modification time back after changing it, but not its change time.
   using ProgramKey = std::tuple<dev_t, ino_t, off_t, std::int64_t, long, std::int64_t, long>;
   static std::optional<ProgramKey> programKey(int fd);
+  std::optional<std::string> digestOfFile(int fd, const ProgramKey& key) const;
   mutable std::map<ProgramKey, std::string> digests_;
 };
 
