@@ -46,9 +46,16 @@ class TortureTest : public DaemonTestBase {
 
 TEST_F(TortureTest, EveryAttackLeavesTheDaemonServingAndRefusesEveryBorrowedIdentity) {
   const std::string requester = foregroundRequester();
+  fs::create_directories(root_ / "var/mobile/Library/UserFonts/FontFiles/com.example.shop");
+  const std::string browser =
+      installApp("browser", "com.example.browser",
+                 R"({"com.zorvane.developer.user-fonts": ["font-enumeration"]})");
   startDaemon();
   auto run = runCommand(
-      torture({"--seconds", "2", "--storm", "300", "--requester", requester + " Missing"}), 180s);
+      torture({"--seconds", "2", "--storm", "300", "--requester", requester + " Missing",
+               "--token-app",
+               browser + " --runtime-dir " + runtime_.string() + " sandbox-open --checkin"}),
+      180s);
   std::cout << "[figures]\n" << run.out;
   EXPECT_EQ(run.status, 0) << run.all << daemon_->output();
   std::istringstream rows(run.out);
@@ -61,7 +68,8 @@ TEST_F(TortureTest, EveryAttackLeavesTheDaemonServingAndRefusesEveryBorrowedIden
     EXPECT_THAT(row, HasSubstr(R"("gotThrough":0,)"));
     EXPECT_THAT(row, Not(HasSubstr(R"("tries":0,)")));
   }
-  EXPECT_EQ(count, 8) << run.out;
+  EXPECT_EQ(count, 9) << run.out;
+  EXPECT_THAT(run.out, HasSubstr("a real token replayed by another process"));
   EXPECT_THAT(run.out, HasSubstr("requesters with the gate or dialog up"));
   // Requesters killed with the gate held left it free for the next one.
   std::istringstream words(requester + " A");

@@ -524,7 +524,8 @@ std::vector<Attack> allAttacks() {
   return {{"malformed frames", malformedFrames}, {"protocol misuse", protocolMisuse},
           {"descriptor flood", descriptorFlood}, {"peers that never read", slowReader},
           {"peers dying mid-call", dyingPeers},  {"connection storm", connectionStorm},
-          {"connect/close churn", churn},        {"identity attacks", identityAttacks}};
+          {"connect/close churn", churn},        {"identity attacks", identityAttacks},
+          {"token attacks", tokenAttacks}};
 }
 
 int runChild(const std::string& mode, const std::string& socket, const std::string& arg) {

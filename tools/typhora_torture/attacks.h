@@ -16,6 +16,9 @@ struct AttackContext {
   // A command that asks for fonts as an entitled foreground application (so the request gate is
   // held and the missing-fonts dialog comes up); killed at random moments. Empty: none.
   std::vector<std::string> requester;
+  // A command that checks in as an application holding fonts and prints its tokens (as
+  // `sandbox-open --checkin` does): the token the sandbox-socket attacks replay. Empty: none.
+  std::vector<std::string> tokenApp;
   std::chrono::steady_clock::time_point until;
 };
 
@@ -31,6 +34,7 @@ struct Attack {
 };
 
 std::vector<Attack> allAttacks();
+AttackOutcome tokenAttacks(const AttackContext& c);
 
 // The child processes the attacks start (`typhora-torture --child MODE SOCKET [ARG]`); the exit
 // status is 0 when the daemon refused, 1 when it answered, 2 when the child could not attack.

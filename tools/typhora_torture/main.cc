@@ -29,7 +29,8 @@ namespace {
 
 constexpr const char* kUsage =
     "usage: typhora-torture [--runtime-dir DIR | --socket PATH] [--pid PID] [--seconds N]\n"
-    "                       [--storm N] [--only NAME,...] [--requester COMMAND] [--json]\n"
+    "                       [--storm N] [--only NAME,...] [--requester COMMAND]\n"
+    "                       [--token-app COMMAND] [--json]\n"
     "  --runtime-dir DIR  where the daemon's socket is (default $TYPHORA_RUNTIME_DIR, else\n"
     "                     /run/typhora)\n"
     "  --socket PATH      the service socket itself\n"
@@ -39,6 +40,9 @@ constexpr const char* kUsage =
     "  --only NAMES       run only the attacks whose names contain one of these words\n"
     "  --requester CMD    a command (words split on spaces) that requests a missing font as an\n"
     "                     entitled foreground application; killed with the gate and dialog up\n"
+    "  --token-app CMD    a command that checks in as an application holding fonts and prints\n"
+    "                     its tokens (`APP sandbox-open --checkin`): the token replayed by the\n"
+    "                     token attacks\n"
     "  --json             one JSON object per row instead of the table\n";
 
 struct Options {
@@ -49,6 +53,7 @@ struct Options {
   std::vector<std::string> only;
   bool json = false;
   std::vector<std::string> requester;
+  std::vector<std::string> tokenApp;
 };
 
 struct Row {
@@ -80,6 +85,9 @@ bool parse(int argc, char** argv, Options* o) {
     } else if (a == "--requester" && hasValue) {
       std::istringstream words(argv[++i]);
       for (std::string w; words >> w;) o->requester.push_back(w);
+    } else if (a == "--token-app" && hasValue) {
+      std::istringstream words(argv[++i]);
+      for (std::string w; words >> w;) o->tokenApp.push_back(w);
     } else if (a == "--only" && hasValue) {
       std::string list = argv[++i];
       for (std::size_t at = 0; at <= list.size();) {
@@ -199,11 +207,9 @@ int main(int argc, char** argv) {
     return 2;
   }
   const DaemonGauge gauge(options.pid);
-  AttackContext context{options.socket,
-                        std::filesystem::read_symlink("/proc/self/exe"),
-                        options.storm,
-                        options.requester,
-                        {}};
+  AttackContext context{options.socket,   std::filesystem::read_symlink("/proc/self/exe"),
+                        options.storm,    options.requester,
+                        options.tokenApp, {}};
 
   ProbeClient probe(options.socket, 20ms);
   probe.start();
