@@ -5,6 +5,7 @@
 #include "catalog/font_record.h"
 #include "daemon/typhora_daemon.h"
 #include "platform/log/log.h"
+#include "platform/value/cbor_encoding_memo.h"
 
 namespace typhora {
 namespace {
@@ -12,6 +13,12 @@ namespace {
 constexpr const char* kMobileHomeFormat = "/var/mobile/%@";
 constexpr const char* kUserFontsFile = "Library/UserFonts/UserFonts.plist";
 constexpr const char* kErrorReading = "error reading %@";
+
+// The enabled records and their kept encoding go together.
+void dropEnabledRecords(Value* enabled) {
+  CborEncodingMemo::shared().forget(*enabled);
+  *enabled = Value();
+}
 
 }  // namespace
 
@@ -41,14 +48,14 @@ void TyphoraDaemon::setUserFontsInfo(Value info) {
   std::lock_guard lock(userFontsInfoMutex_);
   userFontsInfo_ = std::move(info);
   userFontsNameIndex_.reset();
-  enabledUserFontsInfo_ = Value();
+  dropEnabledRecords(&enabledUserFontsInfo_);
 }
 
 void TyphoraDaemon::invalidateUserFonts() {
   std::lock_guard lock(userFontsInfoMutex_);
   userFontsInfo_ = Value();
   userFontsNameIndex_.reset();
-  enabledUserFontsInfo_ = Value();
+  dropEnabledRecords(&enabledUserFontsInfo_);
   ++userFontsGeneration_;
 }
 
@@ -81,6 +88,9 @@ Value TyphoraDaemon::enabledUserFontsInfo() {
       }
     }
     enabledUserFontsInfo_ = Value(Dictionary(std::move(enabled)));
+    // Every enumerating client's check-in carries these records as they are: their encoding is
+    // made once per load and copied into each answer.
+    CborEncodingMemo::shared().keep(enabledUserFontsInfo_);
   }
   return enabledUserFontsInfo_;
 }

@@ -83,6 +83,57 @@ TEST_F(CheckinProcessTest, AProgramChangedInPlaceLosesItsIdentity) {
   EXPECT_EQ(changed.out, "[null]\n");
 }
 
+// The records every enumerating application receives are encoded once per load and copied into
+// each answer: a provider checking in between two enumerating check-ins still gets its own
+// filtered records, and after a font change the answer holds the records read anew.
+TEST_F(CheckinProcessTest, AnAnswerEncodedOnceServesOnlyItsClassAndItsLoad) {
+  auto writeFonts = [this](int others) {
+    std::ofstream file(root_ / "var/mobile/Library/UserFonts/UserFonts.plist");
+    file << "{";
+    for (int i = 0; i < 80; ++i) {
+      file << R"("/var/mobile/Library/UserFonts/FontFiles/com.example.shop/S)" << i
+           << R"(.otf": {"familyName": {"S-Regular": "S"}}, )";
+    }
+    for (int i = 0; i < others; ++i) {
+      file << R"("/var/mobile/Library/UserFonts/FontFiles/com.example.other/O)" << i
+           << R"(.otf": {"familyName": {"O-Regular": "O"}}, )";
+    }
+    file << R"("/var/mobile/Library/UserFonts/FontFiles/com.example.other/Off.otf": )"
+         << R"({"familyName": {"Off-Regular": "Off"}, "disabled": true}})";
+  };
+  writeFonts(40);
+  const std::string browser = install("browser", "com.example.browser", R"(["font-enumeration"])");
+  const std::string shop = install("shop", "com.example.shop", R"(["system-installation"])");
+  startDaemon();
+
+  const auto first = checkin(browser);
+  ASSERT_EQ(first.status, 0) << first.all << daemon_->output();
+  EXPECT_THAT(first.out, HasSubstr("com.example.other/O39.otf"));
+  EXPECT_THAT(first.out, HasSubstr("com.example.shop/S79.otf"));
+  EXPECT_THAT(first.out, Not(HasSubstr("Off.otf")));
+
+  const auto provided = checkin(shop);
+  ASSERT_EQ(provided.status, 0) << provided.all;
+  EXPECT_THAT(provided.out, HasSubstr("com.example.shop/S79.otf"));
+  EXPECT_THAT(provided.out, Not(HasSubstr("com.example.other")));
+
+  const auto again = checkin(browser);
+  ASSERT_EQ(again.status, 0) << again.all;
+  // The tokens differ between processes; the records follow them, under the last key.
+  auto fontsOf = [](const std::string& answer) { return answer.substr(answer.find("fontsInfo")); };
+  EXPECT_EQ(fontsOf(again.out), fontsOf(first.out));
+
+  writeFonts(41);
+  const auto change = ctl({"call", "fontChanged:reply:",
+                           R"({"added": true, "urls": ["file:///var/mobile/Library/UserFonts/)"
+                           R"(FontFiles/com.example.other/O40.otf"]})"});
+  ASSERT_EQ(change.status, 0) << change.all;
+  const auto changed = checkin(browser);
+  ASSERT_EQ(changed.status, 0) << changed.all;
+  EXPECT_THAT(changed.out, HasSubstr("com.example.other/O40.otf"));
+  EXPECT_THAT(changed.out, HasSubstr("com.example.shop/S79.otf"));
+}
+
 // The load's client processes each check in, report font changes and request a font; every call
 // is answered, each is told of the changes, and the report names the daemon it measured.
 TEST_F(CheckinProcessTest, LoadClientsCheckInReportChangesAndMeasureTheDaemon) {

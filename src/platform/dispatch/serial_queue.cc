@@ -1,7 +1,8 @@
 // Serial queues on a shared worker pool. A queue is "scheduled" while it sits in the pool's
 // ready list or a worker (or an inline sync caller) drains it; only then may its jobs run, so
 // they run one at a time. A worker that blocks inside a job keeps its thread: the pool starts
-// another for other queues, up to its cap, and idle workers leave after a while.
+// another for other queues, up to its cap (past a few eager workers, only once the ready queues
+// have waited a moment with no worker coming free), and idle workers leave after a while.
 //
 // A queue that a sync() caller waits on never depends on a free worker: it goes to the front of
 // the line and, when no worker is idle, gets a new one even past the cap. Without that, callers
@@ -68,10 +69,11 @@ class WorkerPool {
     std::lock_guard lock(mutex_);
     if (waitedOn) {
       ready_.push_front(std::move(state));
+      wakeOrStartLocked(SIZE_MAX);
     } else {
       ready_.push_back(std::move(state));
+      wakeOrGrowLocked();
     }
-    wakeOrStartLocked(waitedOn ? SIZE_MAX : limit_);
   }
 
   // A sync() caller now blocks on `state`: if it waits in the ready list, it moves to the front
@@ -98,6 +100,48 @@ class WorkerPool {
  private:
   static constexpr auto kIdleExit = std::chrono::seconds(5);
   static constexpr int kJobsPerTurn = 32;  // then the queue goes to the back of the line
+  // Past the eager workers, a queue that finds no idle worker gets a new one only when the ready
+  // list has not moved for this long: a burst of short jobs (a font change reaching hundreds of
+  // connections) is served by the workers there are, not by a thread per queue, while queues
+  // behind workers blocked in their jobs still get workers of their own soon.
+  static constexpr auto kGrowAfter = std::chrono::milliseconds(1);
+
+  static std::size_t eagerWorkers() {
+    static const std::size_t eager = std::max(2u, std::thread::hardware_concurrency());
+    return eager;
+  }
+
+  // Async work: an idle worker, else a new one while there are fewer than the eager workers,
+  // else the grower adds one if the ready list stalls.
+  void wakeOrGrowLocked() {
+    if (idle_ >= ready_.size() || threads_ < std::min(limit_, eagerWorkers())) {
+      wakeOrStartLocked(limit_);
+      return;
+    }
+    if (threads_ >= limit_) return;
+    if (!growerStarted_) {
+      growerStarted_ = true;
+      std::thread([this] { growerLoop(); }).detach();  // lives as long as the pool
+    }
+    grow_.notify_one();
+  }
+
+  bool stalledLocked() const { return idle_ < ready_.size() && threads_ < limit_; }
+
+  void growerLoop() {
+    std::unique_lock lock(mutex_);
+    for (;;) {
+      grow_.wait(lock, [this] { return stalledLocked(); });
+      const std::uint64_t takenBefore = taken_;
+      const auto deadline = std::chrono::steady_clock::now() + kGrowAfter;
+      while (grow_.wait_until(lock, deadline) != std::cv_status::timeout) {
+      }
+      if (stalledLocked() && taken_ == takenBefore) {
+        ++threads_;
+        std::thread([this] { workerLoop(); }).detach();
+      }
+    }
+  }
 
   void wakeOrStartLocked(std::size_t cap) {
     // A woken worker stays counted as idle until it runs, so compare against all ready queues:
@@ -122,6 +166,7 @@ class WorkerPool {
       }
       StatePtr state = std::move(ready_.front());
       ready_.pop_front();
+      ++taken_;
       lock.unlock();
       drain(state);
       lock.lock();
@@ -153,10 +198,13 @@ class WorkerPool {
 
   std::mutex mutex_;
   std::condition_variable wake_;
+  std::condition_variable grow_;
   std::deque<StatePtr> ready_;
   std::size_t threads_ = 0;
   std::size_t idle_ = 0;
   std::size_t limit_ = 64;
+  std::uint64_t taken_ = 0;  // queues taken from the ready list so far
+  bool growerStarted_ = false;
 };
 
 // Queues `job`; `waiter` counts the caller among the queue's sync() waiters first.

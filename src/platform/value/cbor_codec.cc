@@ -9,6 +9,7 @@
 #include <cstring>
 #include <limits>
 
+#include "platform/value/cbor_encoding_memo.h"
 #include "platform/value/utf8.h"
 
 namespace typhora {
@@ -18,10 +19,27 @@ constexpr std::uint64_t kDateTag = 1;
 
 // ---- Encoding ----
 
+// The kept encoding of a large shared array or dictionary, or null.
+std::shared_ptr<const Bytes> keptEncoding(const void* container, std::size_t items,
+                                          CborEncodingMemo::Encoding* known = nullptr,
+                                          bool* kept = nullptr) {
+  if (items < CborEncodingMemo::kMinimumItems) return nullptr;
+  CborEncodingMemo::Encoding found;
+  const bool isKept = CborEncodingMemo::shared().find(container, &found);
+  if (kept != nullptr) *kept = isKept;
+  if (known != nullptr) *known = found;
+  return found.bytes;
+}
+
 // An upper bound of the encoded size (9 bytes covers any head), so that the output buffer is
 // allocated once: growing a multi-megabyte buffer step by step costs more than encoding it.
 std::size_t sizeBound(const Value& value, std::size_t depth) {
   if (depth > 256) return 0;  // the encoder refuses such depths anyway
+  if (const Dictionary* dictionary = value.asDictionary()) {
+    if (auto kept = keptEncoding(dictionary, dictionary->size())) return kept->size();
+  } else if (const ValueArray* array = value.asArray()) {
+    if (auto kept = keptEncoding(array, array->size())) return kept->size();
+  }
   switch (value.type()) {
     case Value::Type::String:
       return 9 + value.asString()->size();
@@ -53,6 +71,7 @@ class Encoder {
 
   bool encode(const Value& value, std::size_t depth) {
     if (depth > maxDepth_) return fail("nesting deeper than the limit");
+    deepest_ = std::max(deepest_, depth);
     switch (value.type()) {
       case Value::Type::Null:
         return put(cbor_encode_null);
@@ -76,19 +95,23 @@ class Encoder {
                put(cbor_encode_double, value.asDate()->secondsSince1970);
       case Value::Type::Array: {
         const ValueArray& array = *value.asArray();
-        if (!put(cbor_encode_array_start, array.size())) return false;
-        for (const Value& item : array) {
-          if (!encode(item, depth + 1)) return false;
-        }
-        return true;
+        return shared(&array, array.size(), depth, [&] {
+          if (!put(cbor_encode_array_start, array.size())) return false;
+          for (const Value& item : array) {
+            if (!encode(item, depth + 1)) return false;
+          }
+          return true;
+        });
       }
       case Value::Type::Dictionary: {
         const Dictionary& dict = *value.asDictionary();
-        if (!put(cbor_encode_map_start, dict.size())) return false;
-        for (const auto& [key, item] : dict) {
-          if (!bytes(cbor_encode_string_start, key) || !encode(item, depth + 1)) return false;
-        }
-        return true;
+        return shared(&dict, dict.size(), depth, [&] {
+          if (!put(cbor_encode_map_start, dict.size())) return false;
+          for (const auto& [key, item] : dict) {
+            if (!bytes(cbor_encode_string_start, key) || !encode(item, depth + 1)) return false;
+          }
+          return true;
+        });
       }
       case Value::Type::Endpoint:
         return endpoint(*value.asEndpoint());
@@ -97,6 +120,37 @@ class Encoder {
   }
 
  private:
+  // An array or dictionary kept by the memo is copied from its kept encoding, and encoded (then
+  // kept) by `walk` the first time. An encoding that placed endpoints is not kept: their indexes
+  // belong to one message.
+  template <class Walk>
+  bool shared(const void* container, std::size_t items, std::size_t depth, const Walk& walk) {
+    CborEncodingMemo::Encoding known;
+    bool kept = false;
+    if (auto bytes = keptEncoding(container, items, &known, &kept)) {
+      if (depth + known.height > maxDepth_) return fail("nesting deeper than the limit");
+      deepest_ = std::max(deepest_, depth + known.height);
+      ensure(bytes->size());
+      out_.insert(out_.end(), bytes->begin(), bytes->end());
+      return true;
+    }
+    if (!kept) return walk();
+    const std::size_t start = out_.size();
+    const std::size_t endpointsBefore = endpoints_;
+    const std::size_t deepestBefore = deepest_;
+    deepest_ = depth;
+    const bool ok = walk();
+    const std::size_t height = deepest_ - depth;
+    deepest_ = std::max(deepest_, deepestBefore);
+    if (ok && endpoints_ == endpointsBefore) {
+      CborEncodingMemo::shared().store(
+          container, {std::make_shared<const Bytes>(
+                          out_.begin() + static_cast<std::ptrdiff_t>(start), out_.end()),
+                      height});
+    }
+    return ok;
+  }
+
   // Grows the buffer geometrically ahead of writes: resizing a byte vector a few bytes at a time
   // otherwise costs more than the encoding itself.
   void ensure(std::size_t more) {
@@ -126,6 +180,7 @@ class Encoder {
   }
 
   bool endpoint(const std::shared_ptr<const IpcEndpoint>& ep) {
+    ++endpoints_;
     if (hooks_ == nullptr || !hooks_->toIndex) return fail("an endpoint cannot be encoded here");
     std::optional<std::uint64_t> index = hooks_->toIndex(ep);
     if (!index) return fail("the endpoint could not be passed");
@@ -141,6 +196,8 @@ class Encoder {
   const EndpointHooks* hooks_;
   std::string* error_;
   std::size_t maxDepth_;
+  std::size_t deepest_ = 0;    // the deepest level encoded so far
+  std::size_t endpoints_ = 0;  // endpoints met so far
 };
 
 // ---- Decoding ----
@@ -249,7 +306,9 @@ class Builder {
         return;
       }
     }
-    if (text) {
+    if (text && awaitingKey()) {
+      takeKey(std::string(reinterpret_cast<const char*>(data), length));
+    } else if (text) {
       emit(Value(std::string(reinterpret_cast<const char*>(data), length)));
     } else {
       emit(Value(Bytes(data, data + length)));
@@ -285,6 +344,19 @@ class Builder {
   }
 
  private:
+  bool awaitingKey() const {
+    return !done_ && !stack_.empty() && stack_.back().kind == Frame::Kind::Map &&
+           !stack_.back().key;
+  }
+
+  // A dictionary key goes straight to its map, never through a Value.
+  void takeKey(std::string key) {
+    if (++items_ > limits_.maxItems) return fail("too many items");
+    Frame& top = stack_.back();
+    top.key = std::move(key);
+    if (!top.indefinite) --top.remaining;  // never the last item: a value follows
+  }
+
   void closeContainer() {
     Frame frame = std::move(stack_.back());
     stack_.pop_back();

@@ -16,6 +16,13 @@ bool keyLess(const DictionaryEntry& a, const DictionaryEntry& b) {
 }  // namespace
 
 Dictionary::Dictionary(std::vector<DictionaryEntry> entries) : entries_(std::move(entries)) {
+  // Entries already in strictly increasing order (every decoded or derived dictionary) are kept
+  // as they are, after one comparison per pair.
+  const bool strictlyIncreasing =
+      std::adjacent_find(entries_.begin(), entries_.end(), [](const auto& a, const auto& b) {
+        return !keyLess(a, b);
+      }) == entries_.end();
+  if (strictlyIncreasing) return;
   if (!std::is_sorted(entries_.begin(), entries_.end(), keyLess)) {
     std::stable_sort(entries_.begin(), entries_.end(), keyLess);
   }

@@ -9,6 +9,7 @@
 #include <limits>
 
 #include "platform/value/cbor_codec.h"
+#include "platform/value/cbor_encoding_memo.h"
 #include "platform/value/json_codec.h"
 #include "platform/value/plist_reader.h"
 #include "platform/value/value.h"
@@ -154,6 +155,45 @@ TEST(Codecs, NestingIsLimitedExactlyAtTheLimit) {
   EXPECT_THAT(error, HasSubstr("nesting"));
   EXPECT_FALSE(JsonCodec::decode(JsonCodec::encode(nest(9)), limits, &error));
   EXPECT_THAT(error, HasSubstr("nesting"));
+}
+
+// A kept dictionary's encoding is copied into every later message that carries it, wherever it
+// sits: the bytes are those of a walk, the depth limit still counts its levels, and a forgotten
+// or equal but distinct dictionary is walked again.
+TEST(Codecs, AKeptEncodingIsTheWalkedOneAtAnyPlaceAndDepth) {
+  std::vector<DictionaryEntry> records;
+  for (int i = 0; i < 100; ++i) {
+    records.emplace_back(
+        "/fonts/F" + std::to_string(i) + ".otf",
+        Value::dictionary({{"familyName", Value::dictionary({{"F-Bold", "F"}})}, {"size", i}}));
+  }
+  const Value fonts = Value(Dictionary(records));
+  const Value twin = Value(Dictionary(records));
+  auto message = [](const Value& info, const char* token) {
+    return Value::array(
+        {1, "checkin:", Value::dictionary({{"fontsInfo", info}, {"extension", token}})});
+  };
+  const Bytes walked = CborCodec::encode(message(fonts, "a"));
+  auto& memo = CborEncodingMemo::shared();
+  memo.keep(fonts);
+  EXPECT_EQ(CborCodec::encode(message(fonts, "a")), walked);  // walked, then kept
+  EXPECT_EQ(CborCodec::encode(message(fonts, "a")), walked);  // copied
+  EXPECT_EQ(CborCodec::encode(message(twin, "a")), walked);
+  const Bytes other = CborCodec::encode(message(fonts, "b"));
+  EXPECT_NE(other, walked);
+  EXPECT_EQ(CborCodec::decode(other)->at(2).get("extension"), Value("b"));
+  EXPECT_EQ(CborCodec::decode(other)->at(2).get("fontsInfo"), fonts);
+
+  // fontsInfo sits at level 2 and the names in its records at level 5.
+  for (const Value& info : {twin, fonts}) {
+    Bytes out;
+    std::string error;
+    EXPECT_TRUE(CborCodec::encode(message(info, "a"), &out, nullptr, &error, 5));
+    EXPECT_FALSE(CborCodec::encode(message(info, "a"), &out, nullptr, &error, 4));
+    EXPECT_THAT(error, HasSubstr("nesting"));
+  }
+  memo.forget(fonts);
+  EXPECT_EQ(CborCodec::encode(message(fonts, "a")), walked);
 }
 
 TEST(Codecs, MalformedTruncatedAndOversizedInputsAreRefusedWithAReason) {
