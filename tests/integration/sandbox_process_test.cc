@@ -132,6 +132,48 @@ TEST_F(SandboxProcessTest, ASandboxedApplicationReadsAFontOnlyThroughItsOwnToken
   EXPECT_EQ(log.find(refusal, first + 1), std::string::npos) << log;
 }
 
+// An enumerating application holds a token of the font directory, not of each file: in its
+// sandbox the directory's descriptor lists the fonts but opens none, so it asks for each font
+// beneath the directory by name, and gets nothing above it or through a link.
+TEST_F(SandboxProcessTest, AnEnumeratingApplicationOpensTheFontsBeneathItsDirectoryToken) {
+  const std::string browser =
+      installApp("browser", "com.example.browser",
+                 R"({"com.zorvane.developer.user-fonts": ["font-enumeration"]})");
+  const fs::path fonts = root_ / std::string(kFonts).substr(1);
+  fs::create_symlink("../../UserFonts.plist", fonts / "link.otf");
+  start();
+  const std::string a = "com.example.shop/A.otf";
+  auto run =
+      runCommand(sandboxed(browser, {"sandbox-open", "--checkin", "--read", "--direct", "--beneath",
+                                     a, "--beneath", "com.example.shop/../../UserFonts.plist",
+                                     "--beneath", "com.example.shop/link.otf"}),
+                 30s);
+  ASSERT_EQ(run.status, 0) << run.all << daemon_->output();
+  // Each answer by the directory and the entry asked for beneath it.
+  std::map<std::string, Value> answers;
+  std::istringstream in(run.out);
+  for (std::string line; std::getline(in, line);) {
+    std::optional<Value> v = JsonCodec::decode(line);
+    if (!v) continue;
+    const std::string* via = v->get("via").asString();
+    const std::string* path = v->get("path").asString();
+    const std::string* entry = v->get("beneath").asString();
+    if (via == nullptr || path == nullptr) continue;
+    answers[*via + " " + *path + (entry != nullptr ? " " + *entry : "")] = *v;
+  }
+  const std::string directory = "/var/mobile/Library/UserFonts/FontFiles";
+  ASSERT_TRUE(answers.contains("token " + directory)) << run.out;
+  EXPECT_EQ(answers["token " + directory].get("kind"), Value("directory"));
+  EXPECT_EQ(answers["direct " + directory + "/" + a].get("errno"), Value(EACCES)) << run.out;
+  const Value& font = answers["beneath " + directory + " " + a];
+  EXPECT_EQ(font.get("kind"), Value("file")) << run.out;
+  EXPECT_EQ(font.get("head"), Value("font-A"));
+  EXPECT_THAT(error(answers["beneath " + directory + " com.example.shop/../../UserFonts.plist"]),
+              HasSubstr("malformed path"));
+  EXPECT_THAT(error(answers["beneath " + directory + " com.example.shop/link.otf"]),
+              HasSubstr("symbolic links"));
+}
+
 TEST_F(SandboxProcessTest, TheLauncherFailsClosedAndTheSandboxWritesNothing) {
   const std::string plain = installApp("plain", "com.example.plain", kAppUsage, false);
   start();
@@ -167,7 +209,7 @@ TEST_F(SandboxProcessTest, TheSandboxSocketTakesHostilePeersInStride) {
   UniqueFd quiet = client.connect(&failure);
   ASSERT_TRUE(quiet.valid()) << failure;
   EXPECT_EQ(exchange(std::string(64 * 1024, 'x')), "message too long");
-  EXPECT_EQ(exchange(std::string("1;2\0;3", 6)), "malformed token");
+  EXPECT_EQ(exchange(std::string("1;2\0../3", 8)), "malformed path beneath the token's");
   EXPECT_THAT(exchange("not a token"), HasSubstr("not issued to this process"));
 
   // Silent connections up to this user's cap (16, the quiet one among them): the next one is

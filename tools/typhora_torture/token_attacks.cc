@@ -123,6 +123,9 @@ AttackOutcome tokenAttacks(const AttackContext& c) {
           std::filesystem::path(real->path).replace_filename("..sibling.otf").string();
       attempt(client.open(withPath(real->text, sibling)).fd.valid());
       attempt(client.open(withMacChanged(real->text)).fd.valid());
+      // Out of the token's directory by the entry asked for beneath it.
+      attempt(client.open(real->text, "../UserFonts.plist").fd.valid());
+      attempt(client.open(real->text, "a/../../UserFonts.plist").fd.valid());
     }
     attempt(client.open(zero).fd.valid());
     std::string noise(1 + random() % 512, '\0');
@@ -132,11 +135,11 @@ AttackOutcome tokenAttacks(const AttackContext& c) {
     if (devZero >= 0) attempt(rawExchange(socketPath, zero, std::vector<int>(8, devZero)));
   }
   if (devZero >= 0) close(devZero);
-  o.note =
-      real ? "a real token replayed by another process, pointed at a sibling, one "
-             "character of its MAC changed; zero, random and oversized tokens; descriptors pushed"
-           : "no application gave a token to replay (--token-app); zero, random and "
-             "oversized tokens; descriptors pushed";
+  o.note = real ? "a real token replayed by another process, pointed at a sibling, one "
+                  "character of its MAC changed, asked for what lies above it; zero, random and "
+                  "oversized tokens; descriptors pushed"
+                : "no application gave a token to replay (--token-app); zero, random and "
+                  "oversized tokens; descriptors pushed";
   return o;
 }
 

@@ -30,15 +30,17 @@ constexpr const char* kExecUsage =
     "has no Landlock.\n";
 
 constexpr const char* kOpenUsage =
-    "usage: typhoractl sandbox-open TOKEN [--read]\n"
-    "       typhoractl sandbox-open --checkin [--read] [--direct] [--alter PATH] [--also "
-    "TOKEN]...\n"
-    "                               [--child] [--handed]\n"
+    "usage: typhoractl sandbox-open TOKEN [--beneath ENTRY] [--read]\n"
+    "       typhoractl sandbox-open --checkin [--read] [--direct] [--beneath ENTRY]... [--alter "
+    "PATH]\n"
+    "                               [--also TOKEN]... [--child] [--handed]\n"
     "\n"
     "Exchanges a read-only extension token for a descriptor on the daemon's sandbox socket and\n"
     "prints one JSON line {\"via\": ..., \"path\": ..., \"kind\": \"file\"|\"directory\"} or\n"
     "{..., \"error\": REASON}; with --read, the file's first bytes (\"head\") or the directory's\n"
-    "entries (\"entries\"). With TOKEN alone it exits 1 when the token is refused.\n"
+    "entries (\"entries\"). With TOKEN alone it exits 1 when the token is refused. --beneath\n"
+    "ENTRY asks for the entry at the relative path ENTRY beneath the directory a token names\n"
+    "(\"via\": \"beneath\"): in a sandbox, a directory's descriptor lists it but opens nothing.\n"
     "\n"
     "--checkin checks in first as the application this program is signed as, prints the tokens\n"
     "it got ({\"event\": \"checkin\", \"tokens\": [...]}) and exchanges each of them. Then:\n"
@@ -95,8 +97,9 @@ Value contents(const SandboxExtensionResult& result) {
 }
 
 void print(const std::string& via, const std::string& token, const SandboxExtensionResult& result,
-           bool read) {
+           bool read, const std::string& beneath = "") {
   std::vector<DictionaryEntry> fields{{"via", via}, {"path", pathOf(token)}};
+  if (!beneath.empty()) fields.emplace_back("beneath", beneath);
   if (!result.fd.valid()) {
     fields.emplace_back("error", result.error);
   } else {
@@ -146,6 +149,7 @@ struct OpenOptions {
   bool forge = false;
   std::string alter;
   std::vector<std::string> also;
+  std::vector<std::string> beneath;
   std::string token;
 };
 
@@ -200,6 +204,11 @@ int checkedIn(const ClientOptions& options, const std::string& root, const OpenO
   for (const Token& token : tokens) {
     if (open.direct) openDirectly(root, token.path);
     print("token", token.text, client.open(token.text), open.read);
+    for (const std::string& entry : open.beneath) {
+      const std::string below = token.path + (token.path.ends_with('/') ? "" : "/") + entry;
+      if (open.direct) openDirectly(root, below);
+      print("beneath", token.text, client.open(token.text, entry), open.read, entry);
+    }
   }
   for (const std::string& text : open.also) print("also", text, client.open(text), open.read);
   if (!tokens.empty()) misuse(client, tokens.front().text, open);
@@ -259,6 +268,8 @@ int runSandboxOpenCommand(const ClientOptions& options, const std::string& root,
       open.alter = args[++i];
     } else if (args[i] == "--also" && hasValue) {
       open.also.push_back(args[++i]);
+    } else if (args[i] == "--beneath" && hasValue) {
+      open.beneath.push_back(args[++i]);
     } else if (open.token.empty() && !args[i].starts_with("--")) {
       open.token = args[i];
     } else {
@@ -271,8 +282,10 @@ int runSandboxOpenCommand(const ClientOptions& options, const std::string& root,
     std::cerr << kOpenUsage;
     return 2;
   }
-  SandboxExtensionResult result = SandboxExtensionClient(options.runtimeDir).open(open.token);
-  print("token", open.token, result, open.read);
+  const std::string entry = open.beneath.empty() ? "" : open.beneath.front();
+  SandboxExtensionResult result =
+      SandboxExtensionClient(options.runtimeDir).open(open.token, entry);
+  print(entry.empty() ? "token" : "beneath", open.token, result, open.read, entry);
   return result.fd.valid() ? 0 : 1;
 }
 

@@ -13,14 +13,21 @@
 
 namespace typhora {
 
-// `path` (absolute or not) beneath the directory `rootFd`; an invalid descriptor with errno set
-// when it cannot be opened.
-inline UniqueFd openBeneathRoot(int rootFd, const std::string& path, std::uint64_t flags,
-                                std::uint64_t resolve) {
+// openat2(2): `path` from the directory `directoryFd` under the `resolve` rules; an invalid
+// descriptor with errno set when it cannot be opened.
+inline UniqueFd openResolved(int directoryFd, const std::string& path, std::uint64_t flags,
+                             std::uint64_t resolve) {
   open_how how{};
   how.flags = flags;
-  how.resolve = RESOLVE_IN_ROOT | resolve;
-  return UniqueFd(static_cast<int>(syscall(SYS_openat2, rootFd, path.c_str(), &how, sizeof how)));
+  how.resolve = resolve;
+  return UniqueFd(
+      static_cast<int>(syscall(SYS_openat2, directoryFd, path.c_str(), &how, sizeof how)));
+}
+
+// `path` (absolute or not) beneath the directory `rootFd`.
+inline UniqueFd openBeneathRoot(int rootFd, const std::string& path, std::uint64_t flags,
+                                std::uint64_t resolve) {
+  return openResolved(rootFd, path, flags, RESOLVE_IN_ROOT | resolve);
 }
 
 }  // namespace typhora

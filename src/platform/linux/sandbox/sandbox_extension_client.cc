@@ -83,11 +83,12 @@ SandboxExtensionResult SandboxExtensionClient::exchange(int socket, const std::s
   return result;
 }
 
-SandboxExtensionResult SandboxExtensionClient::open(const std::string& token) const {
+SandboxExtensionResult SandboxExtensionClient::open(const std::string& token,
+                                                    const std::string& beneath) const {
   SandboxExtensionResult result;
   UniqueFd socket = connect(&result.error);
   if (!socket.valid()) return result;
-  return exchange(socket.get(), token);
+  return exchange(socket.get(), beneath.empty() ? token : token + '\0' + beneath);
 }
 
 }  // namespace typhora

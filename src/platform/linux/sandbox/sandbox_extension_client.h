@@ -22,8 +22,9 @@ class SandboxExtensionClient {
   UniqueFd connect(std::string* error) const;
   // Sends `token` on `socket` (a fresh connection) and waits for the answer, at most `seconds`.
   static SandboxExtensionResult exchange(int socket, const std::string& token, int seconds = 10);
-  // Both: one exchange on a connection of its own.
-  SandboxExtensionResult open(const std::string& token) const;
+  // Both: one exchange on a connection of its own. With `beneath`, the token names a directory
+  // and the descriptor is of that entry beneath it (a relative path).
+  SandboxExtensionResult open(const std::string& token, const std::string& beneath = "") const;
 
  private:
   std::string runtimeDir_;

@@ -11,6 +11,7 @@
 #include <cstring>
 #include <vector>
 
+#include "platform/linux/files/device_root.h"
 #include "platform/linux/lumo/transport/scm_rights.h"
 #include "platform/linux/sandbox/rooted_open.h"
 #include "platform/linux/sandbox/sandbox_extension_protocol.h"
@@ -201,7 +202,13 @@ std::string SandboxExtensionServer::exchange(const Connection& connection, std::
                                              UniqueFd* opened) const {
   const std::string refused = sandboxexchange::kRefused;
   if (!token.empty() && token.back() == '\0') token.pop_back();
-  if (token.find('\0') != std::string::npos) return refused + "malformed token";
+  // "<token>" or "<token>\0<entry beneath the token's directory>".
+  std::string entry;
+  if (const std::size_t split = token.find('\0'); split != std::string::npos) {
+    entry = token.substr(split + 1);
+    token.resize(split);
+    if (!isPlainRelativePath(entry)) return refused + "malformed path beneath the token's";
+  }
   const std::optional<std::string> path = broker_.verifyExtension(token, connection.pin.token());
   if (!path) return refused + "the token was not issued to this process, or was altered";
   // Verified against the pin: the pinned process must still be the one that spoke.
@@ -209,7 +216,44 @@ std::string SandboxExtensionServer::exchange(const Connection& connection, std::
   std::string kind;
   *opened = openBeneathRoot(*path, &kind);
   if (!opened->valid()) return refused + kind;
+  if (entry.empty()) return kind;
+  if (kind != sandboxexchange::kDirectory) {
+    opened->reset();
+    return refused + "nothing lies beneath a file";
+  }
+  *opened = openEntry(opened->get(), entry, &kind);
+  if (!opened->valid()) return refused + kind;
   return kind;
+}
+
+bool SandboxExtensionServer::isPlainRelativePath(const std::string& path) {
+  // A directory token covers its subtree, and only that: no way up, out or across a link's name.
+  if (path.empty() || path.size() > sandboxexchange::kMaxTokenSize) return false;
+  for (std::size_t at = 0; at <= path.size();) {
+    const std::size_t slash = std::min(path.find('/', at), path.size());
+    if (!DeviceRoot::isSingleComponent(std::string_view(path).substr(at, slash - at))) return false;
+    at = slash + 1;
+  }
+  return true;
+}
+
+UniqueFd SandboxExtensionServer::openEntry(int directory, const std::string& entry,
+                                           std::string* kind) {
+  // Beneath the directory the token opened, following no link, so the entry cannot be swapped
+  // for one outside; a Landlock sandbox would refuse the application the same open by name.
+  UniqueFd fd = openResolved(directory, entry, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC,
+                             RESOLVE_BENEATH | RESOLVE_NO_SYMLINKS | RESOLVE_NO_MAGICLINKS);
+  struct stat info {};
+  if (!fd.valid() || fstat(fd.get(), &info) != 0) {
+    *kind = std::strerror(errno);
+    return {};
+  }
+  if (!S_ISREG(info.st_mode) && !S_ISDIR(info.st_mode)) {
+    *kind = "not a regular file or directory";
+    return {};
+  }
+  *kind = S_ISDIR(info.st_mode) ? sandboxexchange::kDirectory : sandboxexchange::kFile;
+  return fd;
 }
 
 UniqueFd SandboxExtensionServer::openBeneathRoot(const std::string& path, std::string* kind) const {

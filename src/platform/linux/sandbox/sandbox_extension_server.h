@@ -69,6 +69,9 @@ class SandboxExtensionServer {
   // The answer for `token` from `connection`'s peer; `opened` gets the descriptor on success.
   std::string exchange(const Connection& connection, std::string token, UniqueFd* opened) const;
   UniqueFd openBeneathRoot(const std::string& path, std::string* kind) const;
+  // `entry` (plain relative components) beneath the open `directory`, read-only.
+  static UniqueFd openEntry(int directory, const std::string& entry, std::string* kind);
+  static bool isPlainRelativePath(const std::string& path);
   void refuse(const Connection& connection, const std::string& reason);
 
   DeviceRoot root_;
