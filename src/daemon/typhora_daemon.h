@@ -93,7 +93,7 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   // The handlers of the connections still open.
   std::vector<std::shared_ptr<TyphoraHandler>> liveHandlers();
 
-  // --- Introspection for the platform's operators (daemon/status_report.cc) ---
+  // --- Status and grants for the platform's operators (daemon/status_report.cc) ---
   // Built from the calling thread without waiting for any queue, so a busy daemon still answers.
 
   // Uptime, connections, the request gate, the cache, pending deletions, the block list and the

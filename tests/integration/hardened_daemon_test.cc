@@ -67,7 +67,7 @@ class HardenedDaemonTest : public DaemonTestBase {
   }
 };
 
-TEST_F(HardenedDaemonTest, ServesInstallsAndIntrospectionUnderTheUnitsRestrictions) {
+TEST_F(HardenedDaemonTest, ServesInstallsStatusAndGrantsUnderTheUnitsRestrictions) {
   const std::string browser =
       installApp("browser", "com.example.browser",
                  R"({"com.zorvane.developer.user-fonts": ["font-enumeration"]})");

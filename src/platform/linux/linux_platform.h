@@ -35,7 +35,7 @@ class LinuxPlatform {
   // Opens the platform's own sockets (the event socket, the sandbox socket); false when one cannot
   // be opened.
   bool startServices();
-  // What the event socket's introspection operations answer.
+  // What the event socket's status and grants operations answer.
   void setReporter(LinuxEventHub::Reporter reporter) {
     eventHub_->setReporter(std::move(reporter));
   }

@@ -16,7 +16,7 @@ inline constexpr const char* kPostDistributedNotification = "postDistributedNoti
 inline constexpr const char* kPostSystemNotification = "postSystemNotification:";
 inline constexpr const char* kWatchNotifications = "watchNotifications";
 inline constexpr const char* kRunActivity = "runActivity:";
-// Introspection: the daemon's status, and the fonts issued to applications (one, or all when
+// Status and grants: the daemon's status, and the fonts issued to applications (one, or all when
 // the argument is absent).
 inline constexpr const char* kStatusReport = "statusReport";
 inline constexpr const char* kGrantsReport = "grantsReport:";

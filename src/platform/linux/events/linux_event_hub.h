@@ -20,7 +20,7 @@ class LinuxEventHub final : public IpcListenerDelegate,
                             public std::enable_shared_from_this<LinuxEventHub> {
  public:
   using ActivityRunner = std::function<bool(const std::string& identifier)>;
-  // Answers an introspection operation of the event socket (its wire name) with a dictionary.
+  // Answers a status or grants operation of the event socket (its wire name) with a dictionary.
   using Reporter = std::function<Value(const std::string& operation, const Value& argument)>;
 
   LinuxEventHub(LumoService& ipc, LinuxLaunchEventStream& streams) : ipc_(ipc), streams_(streams) {}

@@ -14,9 +14,9 @@ namespace {
 using ::testing::HasSubstr;
 using ::testing::Not;
 
-class IntrospectionProcessTest : public DaemonTestBase {};
+class StatusProcessTest : public DaemonTestBase {};
 
-TEST_F(IntrospectionProcessTest, StatusAndGrantsShowCheckedInClientsAndWhatTheyWereIssued) {
+TEST_F(StatusProcessTest, StatusAndGrantsShowCheckedInClientsAndWhatTheyWereIssued) {
   const std::string browser =
       installApp("browser", "com.example.browser",
                  R"({"com.zorvane.developer.user-fonts": ["font-enumeration"]})");
@@ -77,7 +77,7 @@ TEST_F(IntrospectionProcessTest, StatusAndGrantsShowCheckedInClientsAndWhatTheyW
 }
 
 // The event socket is private to root and the daemon's user: nobody else can ask.
-TEST_F(IntrospectionProcessTest, OtherUsersCannotAsk) {
+TEST_F(StatusProcessTest, OtherUsersCannotAsk) {
   startDaemon();
   fs::permissions(dir_, fs::perms::others_exec, fs::perm_options::add);
   fs::permissions(runtime_, fs::perms::others_exec | fs::perms::others_read, fs::perm_options::add);
