@@ -9,16 +9,14 @@
 #include "platform/linux/lumo/lumo_admission.h"
 #include "platform/linux/lumo/lumo_connection.h"
 #include "support/log_capture.h"
+#include "support/scoped_admission_limits.h"
 
 namespace typhora::testing {
 namespace {
 
 TEST(LumoAdmissionTest, AUserKnockingAtItsCapIsLoggedOnceNotPerConnection) {
   LumoAdmission& admission = LumoAdmission::shared();
-  const LumoAdmissionLimits saved = admission.limits();
-  LumoAdmissionLimits limits = saved;
-  limits.connectionsPerUser = 8;
-  admission.setLimits(limits);
+  const ScopedAdmissionLimits limits([](LumoAdmissionLimits& l) { l.connectionsPerUser = 8; });
   LogCapture log;
   constexpr uid_t kUser = 4242421;
   for (int i = 0; i < 8; ++i) ASSERT_TRUE(admission.admit(kUser));
@@ -42,7 +40,6 @@ TEST(LumoAdmissionTest, AUserKnockingAtItsCapIsLoggedOnceNotPerConnection) {
   for (const LogLine& l : log.lines()) logged += l.message.find(line) != std::string::npos;
   EXPECT_EQ(logged, 1u);
   for (int i = 0; i < 8; ++i) admission.release(kUser);
-  admission.setLimits(saved);
 }
 
 // Accepted connections count against the cap of unfinished handshakes from the accept on, even
@@ -50,10 +47,7 @@ TEST(LumoAdmissionTest, AUserKnockingAtItsCapIsLoggedOnceNotPerConnection) {
 // stayed silent past the grace may be cut off to make room.
 TEST(LumoAdmissionTest, UngreetedConnectionsCountAgainstTheCapAndAreNeverCutOff) {
   LumoAdmission& admission = LumoAdmission::shared();
-  const LumoAdmissionLimits saved = admission.limits();
-  LumoAdmissionLimits limits = saved;
-  limits.unidentified = 4;
-  admission.setLimits(limits);
+  const ScopedAdmissionLimits limits([](LumoAdmissionLimits& l) { l.unidentified = 4; });
   std::vector<std::shared_ptr<LumoConnection>> accepted;
   std::vector<UniqueFd> peers;
   for (int i = 0; i < 4; ++i) {
@@ -75,7 +69,6 @@ TEST(LumoAdmissionTest, UngreetedConnectionsCountAgainstTheCapAndAreNeverCutOff)
   EXPECT_EQ(admission.unidentifiedCount(), 3u);
   for (auto& connection : accepted) connection->invalidate();
   EXPECT_EQ(admission.unidentifiedCount(), 0u);
-  admission.setLimits(saved);
 }
 
 }  // namespace

@@ -16,6 +16,7 @@
 #include "platform/linux/lumo/lumo_service.h"
 #include "support/log_capture.h"
 #include "support/lumo_test_interface.h"
+#include "support/scoped_admission_limits.h"
 
 namespace typhora {
 namespace {
@@ -24,6 +25,7 @@ using namespace std::chrono_literals;
 using ::testing::HasSubstr;
 using typhora::testing::ChildProcess;
 using typhora::testing::runCommand;
+using typhora::testing::ScopedAdmissionLimits;
 namespace fs = std::filesystem;
 
 // Serves the test interface; remembers who called and whose connections went away.
@@ -174,9 +176,8 @@ TEST_F(LumoTest, APeerThatStopsReadingIsCutOffWhileOthersAreAnswered) {
 }
 
 TEST_F(LumoTest, AnswersPiledForPeersThatDoNotReadAreBoundedAcrossConnections) {
-  LumoAdmissionLimits limits;
-  limits.outboundBytes = 512u << 10;  // half of what one peer may pile before its reads pause
-  LumoAdmission::shared().setLimits(limits);
+  // Half of what one peer may pile before its reads pause.
+  const ScopedAdmissionLimits limits([](LumoAdmissionLimits& l) { l.outboundBytes = 512u << 10; });
   testing::LogCapture log;
   ChildProcess flood(peer({"flood", "65536"}));
   for (int i = 0; i < 1000 && !log.contains("over their bound"); ++i) {
@@ -187,7 +188,6 @@ TEST_F(LumoTest, AnswersPiledForPeersThatDoNotReadAreBoundedAcrossConnections) {
   EXPECT_FALSE(log.contains("the peer stopped reading")) << "cut off by the stall, not the bound";
   auto r = runCommand(peer({"call", "count:reply:", "1"}), 30s);
   EXPECT_EQ(r.out, "[2]\n") << r.all;
-  LumoAdmission::shared().setLimits({});
 }
 
 TEST_F(LumoTest, AThousandSimultaneousConnectionsAreServed) {
@@ -197,7 +197,11 @@ TEST_F(LumoTest, AThousandSimultaneousConnectionsAreServed) {
   setrlimit(RLIMIT_NOFILE, &limit);
   if (limit.rlim_cur < 4096) GTEST_SKIP() << "not enough descriptors";
   // One user opening a thousand connections at once: past the caps a service puts on one user.
-  LumoAdmission::shared().setLimits({2000, 2000, 1u << 30, 64});
+  const ScopedAdmissionLimits limits([](LumoAdmissionLimits& l) {
+    l.connectionsPerUser = 2000;
+    l.unidentified = 2000;
+    l.inboundBytes = 1u << 30;
+  });
   LumoService client(dir_);
   std::vector<std::shared_ptr<IpcConnection>> connections;
   std::atomic<int> replies{0};
@@ -219,7 +223,6 @@ TEST_F(LumoTest, AThousandSimultaneousConnectionsAreServed) {
   for (int i = 0; i < 1000; ++i) ASSERT_TRUE(done.waitFor(30s));
   EXPECT_EQ(replies.load(), 1000);
   for (auto& c : connections) c->invalidate();
-  LumoAdmission::shared().setLimits({});
 }
 
 TEST_F(LumoTest, ATokenStopsValidatingOnceItsProcessExecsAnotherProgram) {
