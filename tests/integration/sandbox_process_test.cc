@@ -232,5 +232,28 @@ TEST_F(SandboxProcessTest, TheSandboxSocketTakesHostilePeersInStride) {
   EXPECT_EQ(ctl({"call", "checkin:"}).status, 0);
 }
 
+// One user opening connection after connection holds its own share of the socket, no more: a
+// process of another user is answered meanwhile, and the daemon goes on serving.
+TEST_F(SandboxProcessTest, ACrowdOfOneUserLeavesTheSocketToOthers) {
+  start();
+  fs::permissions(dir_, fs::perms::others_exec, fs::perm_options::add);
+  fs::permissions(runtime_, fs::perms::others_exec | fs::perms::others_read, fs::perm_options::add);
+  const SandboxExtensionClient client(runtime_);
+  std::vector<UniqueFd> crowd;
+  std::string failure;
+  for (int i = 0; i < 600; ++i) {
+    UniqueFd fd = client.connect(&failure);
+    if (fd.valid()) crowd.push_back(std::move(fd));
+  }
+  EXPECT_GT(crowd.size(), 16u) << failure;
+  auto other = runCommand({"/usr/bin/setpriv", "--reuid=65534", "--regid=65534", "--clear-groups",
+                           kCtl, "--runtime-dir", runtime_, "sandbox-open", "not a token"},
+                          20s);
+  EXPECT_EQ(other.status, 1) << other.all;
+  EXPECT_THAT(other.out, HasSubstr("not issued to this process")) << other.all;
+  crowd.clear();
+  EXPECT_EQ(ctl({"call", "checkin:"}).status, 0);
+}
+
 }  // namespace
 }  // namespace typhora::testing
