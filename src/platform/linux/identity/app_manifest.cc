@@ -44,6 +44,12 @@ std::optional<AppManifest> AppManifest::fromValue(const Value& plist, std::strin
     *error = "\"identifier\", \"executable\" and \"sha256\" must be strings";
     return std::nullopt;
   }
+  // An application without a name would be granted and ledgered under "", and a relative
+  // program path names no one file.
+  if (identifier->empty() || !executable->starts_with('/')) {
+    *error = "\"identifier\" must not be empty and \"executable\" must be an absolute path";
+    return std::nullopt;
+  }
   if (!isHexDigest(*sha256)) {
     *error = "\"sha256\" must be 64 lower-case hex digits";
     return std::nullopt;
