@@ -9,7 +9,8 @@
 // pile up is not read until its queue catches up: the kernel holds the rest, and the peer's
 // writes block. Replies to synchronous calls go to the waiting thread, which decodes them, so a
 // synchronous call made from the connection's own queue cannot deadlock and never needs a free
-// worker.
+// worker. While one synchronous call waits, its thread reads the socket itself (with the same
+// checks) and the I/O thread leaves that socket alone.
 //
 // Handshake: the accepting side pins its peer's identity, then (once resumed) sends a Hello
 // with a fresh nonce; the connecting side's first frame must be a Hello carrying that nonce back,
@@ -100,6 +101,11 @@ class LumoConnection final : public IpcConnection {
   // I/O thread.
   void onEvents(std::uint32_t events);
   bool readSome(std::string* error);
+  // A synchronous caller's thread reads the socket itself while it waits, so its answer needs
+  // no hand-off through the I/O thread; one caller at a time, the I/O thread stands aside.
+  bool takeReading();
+  void readUntilAnswered(Pending& pending);
+  void releaseReading();
   bool checkWriter(const ucred& writer, std::string* error);
   bool takeFrame(LumoRawFrame frame, std::string* error);
   bool takeHello(LumoRawFrame frame, std::string* error);
@@ -163,7 +169,12 @@ class LumoConnection final : public IpcConnection {
   std::size_t undispatchedDescriptors_ = 0;
   std::size_t splitterBytes_ = 0;     // the splitter's unfinished frame, as the I/O thread last saw
   std::size_t inboundAccounted_ = 0;  // this connection's share of LumoAdmission's inbound bytes
-  LumoFrameSplitter splitter_;        // touched only by the I/O thread
+  // The read side (splitter_, the socket's receive queue): the I/O thread, or a synchronous
+  // caller that took the reading (callerReads_), holds readMutex_ while it reads. Taken before
+  // mutex_, never after it.
+  std::mutex readMutex_;
+  bool callerReads_ = false;  // under mutex_, set while readMutex_ is held
+  LumoFrameSplitter splitter_;
 };
 
 }  // namespace typhora

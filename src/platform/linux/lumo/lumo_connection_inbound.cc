@@ -1,6 +1,7 @@
 // Reading a lumo connection: on the I/O thread, a budget of reads per turn, the writer's
 // credentials checked on every read, frames cut and handed on; on the connection's queue,
 // invocations decoded, refused or handled, and reading resumed once the queue catches up.
+#include <poll.h>
 #include <sys/epoll.h>
 #include <sys/socket.h>
 
@@ -50,12 +51,68 @@ void LumoConnection::onEvents(std::uint32_t events) {
     }
   }
   if (error.empty() && (events & (EPOLLIN | EPOLLHUP | EPOLLERR | EPOLLRDHUP)) != 0) {
-    if (!readSome(&error)) {
+    std::unique_lock read(readMutex_);
+    bool standAside = false;
+    {
+      std::lock_guard lock(mutex_);
+      standAside = callerReads_;
+    }
+    if (!standAside && !readSome(&error)) {
+      read.unlock();
       end(error, true);
       return;
     }
   }
   if (!error.empty()) end(error, true);
+}
+
+bool LumoConnection::takeReading() {
+  // Set under readMutex_: a read the I/O thread has begun ends first, and it took nothing sent
+  // after the call's request; every later one sees the flag.
+  std::lock_guard read(readMutex_);
+  std::lock_guard lock(mutex_);
+  if (callerReads_ || !resumed_ || !valid_ || !fd_.valid()) return false;
+  callerReads_ = true;
+  updateInterestLocked();
+  return true;
+}
+
+void LumoConnection::readUntilAnswered(Pending& pending) {
+  int fd = -1;
+  {
+    std::lock_guard lock(mutex_);
+    fd = fd_.get();  // set before resume, closed only with the connection
+  }
+  for (;;) {
+    {
+      std::lock_guard lock(pending.mutex);
+      if (pending.done) return;
+    }
+    // The end of the connection shuts the socket down, which wakes the poll; the time limit is
+    // only a second safety for an end that raced the check above.
+    pollfd ready{fd, POLLIN | POLLRDHUP, 0};
+    const int n = poll(&ready, 1, 200);
+    if (n < 0 && errno != EINTR) return;
+    if (n <= 0) continue;
+    std::string error;
+    bool ok = true;
+    {
+      std::lock_guard read(readMutex_);
+      ok = readSome(&error);
+    }
+    if (!ok) {
+      end(error, true);
+      return;
+    }
+  }
+}
+
+void LumoConnection::releaseReading() {
+  std::lock_guard lock(mutex_);
+  callerReads_ = false;
+  // What came after the answer (calls of the peer, later answers) is the I/O thread's again;
+  // re-arming a readable socket reports it at once.
+  updateInterestLocked();
 }
 
 bool LumoConnection::readSome(std::string* error) {
@@ -255,7 +312,7 @@ void LumoConnection::updateInboundLocked() {
 void LumoConnection::updateInterestLocked() {
   if (!resumed_ || !valid_ || !fd_.valid()) return;
   std::uint32_t events = watchingWrites_ ? std::uint32_t{EPOLLOUT} : 0u;
-  if (!readHeldLocked()) events |= EPOLLIN | EPOLLRDHUP;
+  if (!readHeldLocked() && !callerReads_) events |= EPOLLIN | EPOLLRDHUP;
   LumoEventLoop::shared().modify(fd_.get(), events);
 }
 

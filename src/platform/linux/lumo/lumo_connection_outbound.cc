@@ -179,6 +179,8 @@ void LumoConnection::call(const std::string& wireName, std::vector<Value> argume
   pending->synchronous = synchronous;
   std::uint64_t id = 0;
   const bool waits = synchronous && op->replies;
+  // Taken before the request goes out, so the answer cannot reach the I/O thread first.
+  const bool reads = waits && takeReading();
   if (op->replies) {
     std::lock_guard lock(mutex_);
     if (!valid_) {
@@ -199,6 +201,8 @@ void LumoConnection::call(const std::string& wireName, std::vector<Value> argume
     std::lock_guard lock(mutex_);
     pending_.erase(id);
   }
+  if (reads && why.empty() && id != 0) readUntilAnswered(*pending);
+  if (reads) releaseReading();
   if (waits && id != 0) {
     if (why.empty()) {
       std::unique_lock lock(pending->mutex);

@@ -8,10 +8,14 @@
 //   flood DIR [BYTES]      sends calls of BYTES (1 MiB) on a raw socket, never reading answers
 //   garbage DIR            sends bytes that are no frame, then a valid call
 //   notes DIR N            N times: connects, sends the one-way note: and closes at once
+//   callers DIR T N        on one connection, T threads each make N synchronous count:reply:
+//                          calls while one more thread makes asynchronous ones; prints the
+//                          number of wrong or missing answers
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cstring>
 #include <iostream>
 #include <thread>
@@ -105,6 +109,42 @@ int main(int argc, char** argv) {
       connection->invalidate();
     }
     return 0;
+  }
+  if (mode == "callers" && argc == 5) {
+    const int threads = std::stoi(argv[3]);
+    const int calls = std::stoi(argv[4]);
+    auto connection = service.connectToService("test.a");
+    connection->setRemoteInterface(lumoTestInterface());
+    connection->resume();
+    std::atomic<int> wrong{0};
+    Semaphore asyncAnswered;
+    std::vector<std::thread> callers;
+    for (int t = 0; t <= threads; ++t) {
+      callers.emplace_back([&, t] {
+        const bool async = t == threads;
+        auto proxy =
+            async ? connection->remoteObjectProxy([&](const std::string&) { ++wrong; })
+                  : connection->synchronousRemoteObjectProxy([&](const std::string&) { ++wrong; });
+        for (int i = 0; i < calls; ++i) {
+          const std::int64_t n = t * 1'000'000 + i;
+          auto answered = std::make_shared<std::atomic<bool>>(false);
+          proxy->call("count:reply:", {Value(n)}, [&, n, answered](std::vector<Value> r) {
+            *answered = true;
+            if (r.size() != 1 || r[0].asInt() != n + 1) ++wrong;
+            if (async) asyncAnswered.signal();
+          });
+          if (!async && !*answered) ++wrong;
+        }
+        if (async) {
+          for (int i = 0; i < calls; ++i)
+            if (!asyncAnswered.waitFor(std::chrono::seconds(20))) ++wrong;
+        }
+      });
+    }
+    for (auto& caller : callers) caller.join();
+    connection->invalidate();
+    std::cout << wrong.load() << std::endl;
+    return wrong == 0 ? 0 : 1;
   }
   if (mode == "hang") {
     std::cout << "calling" << std::endl;

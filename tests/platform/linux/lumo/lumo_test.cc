@@ -148,6 +148,33 @@ TEST_F(LumoTest, OneWayCallsSentJustBeforeThePeerClosesAreServed) {
   for (int i = 0; i < kNotes; ++i) ASSERT_TRUE(server_->noted.waitFor(20s)) << i;
 }
 
+// A synchronous caller reads its own answer off the socket while the I/O thread stands aside: with
+// several of them on one connection, and asynchronous calls in between, every answer still reaches
+// its own call.
+TEST_F(LumoTest, SynchronousCallersSharingAConnectionEachGetTheirOwnAnswer) {
+  auto run = runCommand(peer({"callers", "6", "300"}), 60s);
+  EXPECT_EQ(run.status, 0) << run.all;
+  EXPECT_EQ(run.out, "0\n");
+}
+
+// A caller blocked reading its own answer is released when another thread ends the connection.
+TEST_F(LumoTest, ACallerWaitingForAnAnswerIsReleasedWhenTheConnectionEnds) {
+  auto connection = service_->connectToService("test.a");
+  connection->setRemoteInterface(lumoTestInterface());
+  connection->resume();
+  std::string error;
+  std::thread caller([&] {
+    connection->synchronousRemoteObjectProxy([&](const std::string& e) { error = e; })
+        ->call("hang:reply:", {}, [](std::vector<Value>) {});
+  });
+  ASSERT_TRUE(server_->hung.waitFor(20s));
+  connection->invalidate();
+  caller.join();
+  EXPECT_THAT(error, HasSubstr("connection invalidated"));
+  // The connection's end reached the server too.
+  EXPECT_TRUE(server_->invalidated.waitFor(20s));
+}
+
 TEST_F(LumoTest, APeerKilledInTheMiddleOfACallRunsTheInvalidationHandlerOnce) {
   ChildProcess child(peer({"hang"}));
   server_->hung.wait();
