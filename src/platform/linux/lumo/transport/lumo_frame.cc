@@ -128,8 +128,11 @@ std::optional<LumoMessage> decodeLumoFrame(
   decodeLimits.maxBytes = limits.maxPayload;
   decodeLimits.maxDepth = limits.maxDepth;
   decodeLimits.maxItems = limits.maxItems;
+  // Large parts of the message stay encoded in the payload until read; endpoints are taken now.
+  auto payload = std::make_shared<const Bytes>(std::move(frame.payload));
   std::string why;
-  std::optional<Value> decoded = CborCodec::decode(frame.payload, decodeLimits, &hooks, &why);
+  std::optional<Value> decoded =
+      CborCodec::decodeLazily(payload, *payload, decodeLimits, &hooks, &why);
   if (!decoded) {
     *error = "undecodable message: " + why;
     return std::nullopt;
