@@ -27,9 +27,21 @@ bool finiteFloat(std::uint8_t initial, const std::uint8_t* at) {
   return ((bigEndian(at, 8) >> 52) & 0x7ff) != 0x7ff;
 }
 
+// Byte-wise order, eight bytes at a time: keys often share long prefixes (paths).
 bool byteLess(const std::uint8_t* a, std::size_t aSize, const std::uint8_t* b, std::size_t bSize) {
-  const int order = std::memcmp(a, b, std::min(aSize, bSize));
-  return order < 0 || (order == 0 && aSize < bSize);
+  const std::size_t common = std::min(aSize, bSize);
+  std::size_t i = 0;
+  for (; i + 8 <= common; i += 8) {
+    std::uint64_t x = 0;
+    std::uint64_t y = 0;
+    std::memcpy(&x, a + i, 8);
+    std::memcpy(&y, b + i, 8);
+    if (x != y) return __builtin_bswap64(x) < __builtin_bswap64(y);
+  }
+  for (; i < common; ++i) {
+    if (a[i] != b[i]) return a[i] < b[i];
+  }
+  return aSize < bSize;
 }
 
 }  // namespace
@@ -49,27 +61,30 @@ bool CborScanner::scan(std::span<const std::uint8_t> input, const DecodeLimits& 
   const std::size_t before = lazy->size();
   CborScanner scanner(input, limits, endpoints, lazyBytes, lazy);
   std::size_t height = 0;
-  if (!scanner.item(0, &height) || scanner.at_ != input.size()) return false;
+  if (!scanner.count(1) || !scanner.item(0, &height) || scanner.at_ != input.size()) return false;
   // Containers were listed as they closed, inner ones first; the reader meets them as they open.
   std::sort(lazy->begin() + static_cast<std::ptrdiff_t>(before), lazy->end(),
             [](const Container& a, const Container& b) { return a.begin < b.begin; });
   return true;
 }
 
-bool CborScanner::count(std::size_t items) {
+// Items are counted as the stream decoder counts them (every value, every key, a tag's content
+// besides the tag), by the container that declares them.
+[[gnu::always_inline]] inline bool CborScanner::count(std::uint64_t items) {
+  if (items > limits_.maxItems - items_) return false;
   items_ += items;
-  return items_ <= limits_.maxItems;
+  return true;
 }
 
-bool CborScanner::take(std::uint64_t size) {
+[[gnu::always_inline]] inline bool CborScanner::take(std::uint64_t size) {
   if (size > size_ - at_) return false;
   at_ += size;
   return true;
 }
 
-// Reads the head at the cursor (not of major type 7): its argument; a longer head than needed
-// marks the container as not the encoder's.
-bool CborScanner::head(std::uint64_t* argument) {
+// Reads the head at the cursor (not of major type 7): its argument, and whether it is as short
+// as the encoder writes it.
+[[gnu::always_inline]] inline bool CborScanner::head(std::uint64_t* argument, bool* shortest) {
   const std::uint8_t info = data_[at_++] & 0x1f;
   if (info < 24) {
     *argument = info;
@@ -80,12 +95,11 @@ bool CborScanner::head(std::uint64_t* argument) {
   if (width > size_ - at_) return false;
   *argument = bigEndian(data_ + at_, width);
   at_ += width;
-  const std::uint64_t shortest = info == 24 ? 24 : std::uint64_t{1} << (4 * width);
-  if (*argument < shortest) canonical_ = false;
+  *shortest = *argument >= (info == 24 ? 24 : std::uint64_t{1} << (4 * width));
   return true;
 }
 
-bool CborScanner::text(std::uint64_t size) {
+[[gnu::always_inline]] inline bool CborScanner::text(std::uint64_t size) {
   const std::size_t begin = at_;
   if (!take(size)) return false;
   return isValidUtf8(
@@ -98,26 +112,23 @@ bool CborScanner::item(std::size_t depth, std::size_t* height) {
   const std::size_t begin = at_;
   const std::uint8_t initial = data_[at_];
   const unsigned major = initial >> 5;
-  if (major == 7) return simple(initial) && count(1);
+  if (major == 7) return simple(initial);
   std::uint64_t argument = 0;
-  const bool outer = canonical_;
-  canonical_ = true;
-  if (!head(&argument)) return false;
-  const bool shortest = canonical_;
-  canonical_ = outer && shortest;
+  bool shortest = true;
+  if (!head(&argument, &shortest)) return false;
+  if (major == 4 || major == 5) {
+    return container(argument, major == 5, shortest, begin, depth, height);
+  }
+  canonical_ = canonical_ && shortest;
   switch (major) {
     case 0:
-      return count(1);
+      return true;
     case 1:
-      return argument <= static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max()) &&
-             count(1);
+      return argument <= static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max());
     case 2:
-      return take(argument) && count(1);
+      return take(argument);
     case 3:
-      return text(argument) && count(1);
-    case 4:
-    case 5:
-      return container(argument, major == 5, shortest, begin, depth, height);
+      return text(argument);
     default:
       return tag(argument, initial, depth);
   }
@@ -148,11 +159,13 @@ bool CborScanner::simple(std::uint8_t initial) {
 bool CborScanner::tag(std::uint64_t number, std::uint8_t initial, std::size_t depth) {
   if (depth >= limits_.maxDepth || at_ >= size_) return false;
   const std::uint8_t content = data_[at_];
+  if (!count(1)) return false;
+  bool shortest = true;
   if (number == kCborEndpointTag && endpoints_) {
     if ((content >> 5) != 0) return false;
     holdsEndpoint_ = true;
     std::uint64_t index = 0;
-    return head(&index) && count(2);
+    return head(&index, &shortest);
   }
   if (number != kDateTag) return false;
   if (initial != 0xc1) canonical_ = false;
@@ -160,26 +173,26 @@ bool CborScanner::tag(std::uint64_t number, std::uint8_t initial, std::size_t de
     const std::size_t width = content == 0xf9 ? 2 : content == 0xfa ? 4 : 8;
     if (content != 0xfb) canonical_ = false;
     ++at_;
-    if (!take(width) || !finiteFloat(content, data_ + at_ - width)) return false;
-    return count(2);
+    return take(width) && finiteFloat(content, data_ + at_ - width);
   }
   // An integer number of seconds: the encoder writes a double.
   if ((content >> 5) > 1) return false;
   canonical_ = false;
   std::uint64_t seconds = 0;
-  if (!head(&seconds)) return false;
-  return ((content >> 5) == 0 ||
-          seconds <= static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max())) &&
-         count(2);
+  if (!head(&seconds, &shortest)) return false;
+  return (content >> 5) == 0 ||
+         seconds <= static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max());
 }
 
 // A dictionary key: definite text; keys out of strictly increasing order are the encoder's no more.
 bool CborScanner::key(const std::uint8_t** previous, std::size_t* previousSize) {
   if (at_ >= size_ || (data_[at_] >> 5) != 3) return false;
   std::uint64_t size = 0;
-  if (!head(&size)) return false;
+  bool shortest = true;
+  if (!head(&size, &shortest)) return false;
+  canonical_ = canonical_ && shortest;
   const std::uint8_t* key = data_ + at_;
-  if (!text(size) || !count(1)) return false;
+  if (!text(size)) return false;
   if (*previous != nullptr && !byteLess(*previous, *previousSize, key, size)) canonical_ = false;
   *previous = key;
   *previousSize = size;
@@ -190,7 +203,7 @@ bool CborScanner::container(std::uint64_t count, bool dictionary, bool shortest,
                             std::size_t depth, std::size_t* height) {
   if (depth >= limits_.maxDepth || depth >= kMaxRecursion) return false;
   // Every item takes a byte at least: a longer declared count is truncated input.
-  if (count > size_ - at_ || (dictionary ? count * 2 : count) > limits_.maxItems) return false;
+  if (count > size_ - at_ || !this->count(dictionary ? count * 2 : count)) return false;
   const bool outerCanonical = canonical_;
   const bool outerEndpoint = holdsEndpoint_;
   canonical_ = shortest;
@@ -203,7 +216,6 @@ bool CborScanner::container(std::uint64_t count, bool dictionary, bool shortest,
     if (!item(depth + 1, &below)) return false;
     *height = std::max(*height, below + 1);
   }
-  if (!this->count(1)) return false;
   if (lazyBytes_ > 0 && canonical_ && !holdsEndpoint_ && at_ - begin >= lazyBytes_) {
     lazy_->push_back({begin, at_, *height, dictionary});
   }

@@ -40,7 +40,7 @@ class CborScanner {
               std::size_t lazyBytes, std::vector<Container>* lazy);
 
   bool item(std::size_t depth, std::size_t* height);
-  bool head(std::uint64_t* argument);
+  bool head(std::uint64_t* argument, bool* shortest);
   bool container(std::uint64_t count, bool dictionary, bool shortest, std::size_t begin,
                  std::size_t depth, std::size_t* height);
   bool key(const std::uint8_t** previous, std::size_t* previousSize);
@@ -48,7 +48,7 @@ class CborScanner {
   bool simple(std::uint8_t initial);
   bool text(std::uint64_t size);
   bool take(std::uint64_t size);
-  bool count(std::size_t items);
+  bool count(std::uint64_t items);
 
   const std::uint8_t* data_;
   std::size_t size_;
