@@ -21,7 +21,7 @@ std::uint64_t bigEndian(const std::uint8_t* at, std::size_t width) {
   return value;
 }
 
-bool finiteFloat(std::uint8_t initial, const std::uint8_t* at) {
+inline bool finiteFloat(std::uint8_t initial, const std::uint8_t* at) {
   if (initial == 0xf9) return ((bigEndian(at, 2) >> 10) & 0x1f) != 0x1f;
   if (initial == 0xfa) return ((bigEndian(at, 4) >> 23) & 0xff) != 0xff;
   return ((bigEndian(at, 8) >> 52) & 0x7ff) != 0x7ff;
@@ -106,6 +106,24 @@ bool CborScanner::scan(std::span<const std::uint8_t> input, const DecodeLimits& 
       {reinterpret_cast<const char*>(data_ + begin), static_cast<std::size_t>(size)});
 }
 
+// The commonest items in a single byte or a short text, taken without a call: small integers,
+// booleans, null, text shorter than 24 bytes. False (and nothing taken) for anything else.
+[[gnu::always_inline]] inline bool CborScanner::atom(std::uint8_t initial) {
+  if (initial < 0x18 || (initial >= 0x20 && initial < 0x38) || initial == 0xf4 || initial == 0xf5 ||
+      initial == 0xf6) {
+    ++at_;
+    return true;
+  }
+  if (initial < 0x60 || initial >= 0x78) return false;
+  const std::size_t size = initial - 0x60u;
+  if (size > size_ - at_ - 1 ||
+      !isValidUtf8({reinterpret_cast<const char*>(data_ + at_ + 1), size})) {
+    return false;  // item() sees it again and refuses it
+  }
+  at_ += 1 + size;
+  return true;
+}
+
 bool CborScanner::item(std::size_t depth, std::size_t* height) {
   *height = 0;
   if (at_ >= size_) return false;
@@ -185,7 +203,8 @@ bool CborScanner::tag(std::uint64_t number, std::uint8_t initial, std::size_t de
 }
 
 // A dictionary key: definite text; keys out of strictly increasing order are the encoder's no more.
-bool CborScanner::key(const std::uint8_t** previous, std::size_t* previousSize) {
+[[gnu::always_inline]] inline bool CborScanner::key(const std::uint8_t** previous,
+                                                    std::size_t* previousSize) {
   if (at_ >= size_ || (data_[at_] >> 5) != 3) return false;
   std::uint64_t size = 0;
   bool shortest = true;
@@ -212,6 +231,10 @@ bool CborScanner::container(std::uint64_t count, bool dictionary, bool shortest,
   std::size_t previousSize = 0;
   for (std::uint64_t i = 0; i < count; ++i) {
     if (dictionary && !key(&previous, &previousSize)) return false;
+    if (at_ < size_ && atom(data_[at_])) {
+      *height = std::max<std::size_t>(*height, 1);
+      continue;
+    }
     std::size_t below = 0;
     if (!item(depth + 1, &below)) return false;
     *height = std::max(*height, below + 1);

@@ -40,6 +40,7 @@ class CborScanner {
               std::size_t lazyBytes, std::vector<Container>* lazy);
 
   bool item(std::size_t depth, std::size_t* height);
+  bool atom(std::uint8_t initial);
   bool head(std::uint64_t* argument, bool* shortest);
   bool container(std::uint64_t count, bool dictionary, bool shortest, std::size_t begin,
                  std::size_t depth, std::size_t* height);
