@@ -95,12 +95,20 @@ LumoFrameSplitter::Status LumoFrameSplitter::next(LumoRawFrame* frame, std::stri
 
   frame->kind = static_cast<LumoMessage::Kind>(*kind);
   frame->id = *id;
-  frame->payload.assign(payload.begin(), payload.end());
   frame->descriptors.clear();
   for (std::uint32_t i = 0; i < descriptorCount; ++i) {
     frame->descriptors.push_back(std::move(descriptors_[i]));
   }
   descriptors_.erase(descriptors_.begin(), descriptors_.begin() + descriptorCount);
+  if (consumed_ == 0 && kLumoHeaderSize + length == buffer_.size()) {
+    // The frame is all that is buffered, as a large message usually is once complete: the buffer
+    // becomes the payload, without a second allocation of its size.
+    buffer_.erase(buffer_.begin(), buffer_.begin() + kLumoHeaderSize);
+    frame->payload = std::move(buffer_);
+    buffer_.clear();
+    return Status::Frame;
+  }
+  frame->payload.assign(payload.begin(), payload.end());
   consumed_ += kLumoHeaderSize + length;
   if (consumed_ == buffer_.size()) {
     buffer_.clear();
