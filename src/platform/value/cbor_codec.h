@@ -31,8 +31,9 @@ class CborCodec {
   static constexpr std::size_t kLazyBytes = 4096;
   // As decode, and refusing the same inputs up front, but arrays and dictionaries of at least
   // `lazyBytes` bytes, already encoded as the encoder writes them and holding no endpoint, stay
-  // encoded until first opened, keeping `owner` (which holds `input`) alive. Opening one never
-  // fails; encoding one copies its bytes.
+  // encoded until first opened, keeping `owner` (which holds `input`) alive: any part still
+  // encoded keeps all of `input` in memory. Opening one never fails; encoding one copies its
+  // bytes. Without an owner, as decode.
   static std::optional<Value> decodeLazily(std::shared_ptr<const void> owner,
                                            std::span<const std::uint8_t> input,
                                            const DecodeLimits& limits = {},
