@@ -1,7 +1,9 @@
-// Encoding and decoding a user-fonts dictionary of 10,000 records in CBOR and JSON.
+// Encoding and decoding a user-fonts dictionary of 10,000 records in CBOR and JSON; decoding
+// CBOR with large containers left encoded, and decoding then reading every value.
 #include <benchmark/benchmark.h>
 
 #include "platform/value/cbor_codec.h"
+#include "platform/value/cbor_stream_decoder.h"
 #include "platform/value/json_codec.h"
 
 namespace typhora {
@@ -57,6 +59,51 @@ void BM_CborDecode(benchmark::State& state) {
   report(state, encoded.size());
 }
 
+void BM_CborDecodeStream(benchmark::State& state) {
+  const Bytes encoded = CborCodec::encode(fonts());
+  DecodeLimits limits;
+  for (auto _ : state) {
+    auto v = CborStreamDecoder::decode(encoded, limits, nullptr, nullptr);
+    benchmark::DoNotOptimize(v);
+  }
+  report(state, encoded.size());
+}
+
+void BM_CborDecodeLazy(benchmark::State& state) {
+  const auto encoded = std::make_shared<const Bytes>(CborCodec::encode(fonts()));
+  DecodeLimits limits;
+  for (auto _ : state) {
+    auto v = CborCodec::decodeLazily(encoded, *encoded, limits);
+    benchmark::DoNotOptimize(v);
+  }
+  report(state, encoded->size());
+}
+
+// Opens every array and dictionary and touches every scalar.
+std::size_t walk(const Value& value) {
+  std::size_t seen = 1;
+  if (const Dictionary* dictionary = value.asDictionary()) {
+    for (const auto& [key, item] : *dictionary) seen += key.size() + walk(item);
+  } else if (const ValueArray* array = value.asArray()) {
+    for (const Value& item : *array) seen += walk(item);
+  } else if (const std::string* text = value.asString()) {
+    seen += text->size();
+  }
+  return seen;
+}
+
+template <bool kLazy>
+void BM_CborDecodeThenWalk(benchmark::State& state) {
+  const auto encoded = std::make_shared<const Bytes>(CborCodec::encode(fonts()));
+  DecodeLimits limits;
+  for (auto _ : state) {
+    auto v = kLazy ? CborCodec::decodeLazily(encoded, *encoded, limits)
+                   : CborCodec::decode(*encoded, limits);
+    benchmark::DoNotOptimize(walk(*v));
+  }
+  report(state, encoded->size());
+}
+
 void BM_JsonEncode(benchmark::State& state) {
   std::size_t size = 0;
   for (auto _ : state) {
@@ -78,6 +125,10 @@ void BM_JsonDecode(benchmark::State& state) {
 
 BENCHMARK(BM_CborEncode)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_CborDecode)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_CborDecodeStream)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_CborDecodeLazy)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_CborDecodeThenWalk<false>)->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_CborDecodeThenWalk<true>)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_JsonEncode)->Unit(benchmark::kMillisecond);
 BENCHMARK(BM_JsonDecode)->Unit(benchmark::kMillisecond);
 

@@ -2,6 +2,7 @@
 // Dates are tag 1 with a double; data are byte strings; endpoints use kCborEndpointTag.
 #pragma once
 
+#include <memory>
 #include <optional>
 #include <span>
 #include <string>
@@ -25,6 +26,20 @@ class CborCodec {
                                      const DecodeLimits& limits = {},
                                      const EndpointHooks* hooks = nullptr,
                                      std::string* error = nullptr);
+
+  // Arrays and dictionaries of at least this many encoded bytes may stay encoded.
+  static constexpr std::size_t kLazyBytes = 4096;
+  // As decode, and refusing the same inputs up front, but arrays and dictionaries of at least
+  // `lazyBytes` bytes, already encoded as the encoder writes them and holding no endpoint, stay
+  // encoded until first opened, keeping `owner` (which holds `input`) alive: any part still
+  // encoded keeps all of `input` in memory. Opening one never fails; encoding one copies its
+  // bytes. Without an owner, as decode.
+  static std::optional<Value> decodeLazily(std::shared_ptr<const void> owner,
+                                           std::span<const std::uint8_t> input,
+                                           const DecodeLimits& limits = {},
+                                           const EndpointHooks* hooks = nullptr,
+                                           std::string* error = nullptr,
+                                           std::size_t lazyBytes = kLazyBytes);
 };
 
 }  // namespace typhora

@@ -5,6 +5,7 @@
 #include <limits>
 
 #include "platform/value/json_codec.h"
+#include "platform/value/lazy_container.h"
 
 namespace typhora {
 namespace {
@@ -56,6 +57,10 @@ Value::Value(std::shared_ptr<const IpcEndpoint> endpoint) {
   if (endpoint) v_ = std::move(endpoint);
 }
 
+Value::Value(std::shared_ptr<const LazyContainer> encoded) {
+  if (encoded) v_ = std::move(encoded);
+}
+
 void Value::setUnsigned(std::uint64_t u) {
   if (u <= static_cast<std::uint64_t>(std::numeric_limits<std::int64_t>::max())) {
     v_ = static_cast<std::int64_t>(u);
@@ -65,7 +70,15 @@ void Value::setUnsigned(std::uint64_t u) {
 }
 
 Value::Type Value::type() const {
+  if (const LazyContainer* lazy = lazyContainer()) {
+    return lazy->isDictionary() ? Type::Dictionary : Type::Array;
+  }
   return static_cast<Type>(v_.index());
+}
+
+const LazyContainer* Value::lazyContainer() const {
+  auto* p = std::get_if<std::shared_ptr<const LazyContainer>>(&v_);
+  return p ? p->get() : nullptr;
 }
 
 bool Value::isNumber() const {
@@ -111,13 +124,15 @@ std::optional<Date> Value::asDate() const {
 }
 
 const ValueArray* Value::asArray() const {
-  auto* p = std::get_if<std::shared_ptr<const ValueArray>>(&v_);
-  return p ? p->get() : nullptr;
+  if (auto* p = std::get_if<std::shared_ptr<const ValueArray>>(&v_)) return p->get();
+  const LazyContainer* lazy = lazyContainer();
+  return lazy ? lazy->array() : nullptr;
 }
 
 const Dictionary* Value::asDictionary() const {
-  auto* p = std::get_if<std::shared_ptr<const Dictionary>>(&v_);
-  return p ? p->get() : nullptr;
+  if (auto* p = std::get_if<std::shared_ptr<const Dictionary>>(&v_)) return p->get();
+  const LazyContainer* lazy = lazyContainer();
+  return lazy ? lazy->dictionary() : nullptr;
 }
 
 const std::shared_ptr<const IpcEndpoint>* Value::asEndpoint() const {
@@ -164,7 +179,13 @@ std::string Value::description() const {
 }
 
 bool operator==(const Value& a, const Value& b) {
-  if (a.v_.index() != b.v_.index()) return false;
+  if (a.type() != b.type()) return false;
+  const LazyContainer* encodedA = a.lazyContainer();
+  const LazyContainer* encodedB = b.lazyContainer();
+  if (encodedA != nullptr && encodedB != nullptr &&
+      std::ranges::equal(encodedA->encoding(), encodedB->encoding())) {
+    return true;  // the same bytes decode to the same value
+  }
   switch (a.type()) {
     case Value::Type::Data:
       return *a.asData() == *b.asData();

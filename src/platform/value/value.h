@@ -7,6 +7,9 @@
 //
 // Dictionaries keep their entries sorted by key (byte-wise), so iteration order, and with it every
 // "first match", is the same on every run.
+//
+// A large array or dictionary decoded from CBOR may still be in its encoding (a LazyContainer):
+// it is read when first opened, and nothing else about it differs.
 #pragma once
 
 #include <cstddef>
@@ -25,6 +28,7 @@
 namespace typhora {
 
 class IpcEndpoint;
+class LazyContainer;
 class Value;
 
 // A point in time, as seconds since 1970-01-01T00:00:00Z.
@@ -81,6 +85,8 @@ class Value {
   Value(ValueArray array);                             // NOLINT
   Value(Dictionary dict);                              // NOLINT
   Value(std::shared_ptr<const IpcEndpoint> endpoint);  // NOLINT
+  // An array or dictionary still encoded (made by the CBOR decoder).
+  explicit Value(std::shared_ptr<const LazyContainer> encoded);
 
   // Builders: Value::array({1, "two"}), Value::dictionary({{"a", 1}, {"b", true}}).
   static Value array(std::initializer_list<Value> items);
@@ -106,6 +112,8 @@ class Value {
   const ValueArray* asArray() const;
   const Dictionary* asDictionary() const;
   const std::shared_ptr<const IpcEndpoint>* asEndpoint() const;
+  // The container when it is still encoded (opened or not), for the encoder to copy.
+  const LazyContainer* lazyContainer() const;
 
   // Dictionary lookup: the value under `key`, or a null Value when this is not a dictionary or
   // the key is missing. Chains: info.get("familyName").get("Foo-Bold").asString().
@@ -129,7 +137,8 @@ class Value {
 
   std::variant<std::monostate, bool, std::int64_t, std::uint64_t, double, std::string,
                std::shared_ptr<const Bytes>, Date, std::shared_ptr<const ValueArray>,
-               std::shared_ptr<const Dictionary>, std::shared_ptr<const IpcEndpoint>>
+               std::shared_ptr<const Dictionary>, std::shared_ptr<const IpcEndpoint>,
+               std::shared_ptr<const LazyContainer>>
       v_;
 };
 

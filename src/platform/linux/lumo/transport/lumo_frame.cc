@@ -95,12 +95,20 @@ LumoFrameSplitter::Status LumoFrameSplitter::next(LumoRawFrame* frame, std::stri
 
   frame->kind = static_cast<LumoMessage::Kind>(*kind);
   frame->id = *id;
-  frame->payload.assign(payload.begin(), payload.end());
   frame->descriptors.clear();
   for (std::uint32_t i = 0; i < descriptorCount; ++i) {
     frame->descriptors.push_back(std::move(descriptors_[i]));
   }
   descriptors_.erase(descriptors_.begin(), descriptors_.begin() + descriptorCount);
+  if (consumed_ == 0 && kLumoHeaderSize + length == buffer_.size()) {
+    // The frame is all that is buffered, as a large message usually is once complete: the buffer
+    // becomes the payload, without a second allocation of its size.
+    buffer_.erase(buffer_.begin(), buffer_.begin() + kLumoHeaderSize);
+    frame->payload = std::move(buffer_);
+    buffer_.clear();
+    return Status::Frame;
+  }
+  frame->payload.assign(payload.begin(), payload.end());
   consumed_ += kLumoHeaderSize + length;
   if (consumed_ == buffer_.size()) {
     buffer_.clear();
@@ -128,8 +136,11 @@ std::optional<LumoMessage> decodeLumoFrame(
   decodeLimits.maxBytes = limits.maxPayload;
   decodeLimits.maxDepth = limits.maxDepth;
   decodeLimits.maxItems = limits.maxItems;
+  // Large parts of the message stay encoded in the payload until read; endpoints are taken now.
+  auto payload = std::make_shared<const Bytes>(std::move(frame.payload));
   std::string why;
-  std::optional<Value> decoded = CborCodec::decode(frame.payload, decodeLimits, &hooks, &why);
+  std::optional<Value> decoded =
+      CborCodec::decodeLazily(payload, *payload, decodeLimits, &hooks, &why);
   if (!decoded) {
     *error = "undecodable message: " + why;
     return std::nullopt;
