@@ -4,6 +4,7 @@
 #include <simdjson.h>
 #include <sodium.h>
 
+#include <algorithm>
 #include <charconv>
 #include <cmath>
 #include <cstdio>
@@ -17,9 +18,17 @@ constexpr std::string_view kDateKey = "$date";
 
 // ---- Dates in RFC 3339 ----
 
+// RFC 3339 has years 0000 to 9999; a date a peer sent may lie anywhere a double reaches, and
+// converting one past time_t is undefined. Such dates are written as the nearest year that can be.
+constexpr double kFirstSecond = -62'167'219'200.0;  // 0000-01-01T00:00:00Z
+constexpr double kLastSecond = 253'402'300'799.0;   // 9999-12-31T23:59:59Z
+
 std::string formatDate(Date date) {
-  double whole = std::floor(date.secondsSince1970);
-  double fraction = date.secondsSince1970 - whole;
+  const double seconds = std::isnan(date.secondsSince1970)
+                             ? 0.0
+                             : std::clamp(date.secondsSince1970, kFirstSecond, kLastSecond);
+  double whole = std::floor(seconds);
+  double fraction = seconds - whole;
   std::time_t t = static_cast<std::time_t>(whole);
   std::tm tm{};
   gmtime_r(&t, &tm);

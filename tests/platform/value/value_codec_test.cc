@@ -134,6 +134,11 @@ TEST(Codecs, JsonSpecialFormsAndDates) {
   EXPECT_EQ(v->get("notSpecial").type(), Value::Type::Dictionary);
   EXPECT_EQ(v->get("big").type(), Value::Type::Double);
   EXPECT_EQ(JsonCodec::encode(Value(Date{0})), R"({"$date":"1970-01-01T00:00:00Z"})");
+  // Dates no calendar of four-digit years holds, as a peer may send them, are written as the
+  // nearest one that can be (logging such a value once meant an undefined conversion).
+  EXPECT_EQ(JsonCodec::encode(Value(Date{-1.8e165})), R"({"$date":"0000-01-01T00:00:00Z"})");
+  EXPECT_EQ(JsonCodec::encode(Value(Date{HUGE_VAL})), R"({"$date":"9999-12-31T23:59:59Z"})");
+  EXPECT_EQ(JsonCodec::encode(Value(Date{std::nan("")})), R"({"$date":"1970-01-01T00:00:00Z"})");
   std::string error;
   EXPECT_FALSE(JsonCodec::decode(R"({"$date": "yesterday"})", {}, &error));
   EXPECT_THAT(error, HasSubstr("$date"));
