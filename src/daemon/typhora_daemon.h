@@ -25,6 +25,7 @@ namespace typhora {
 
 class TyphoraHandler;
 class MissingFontsDialogHandler;
+class FontChangeMessages;
 
 inline constexpr const char* kServiceName = "com.zorvane.typhorad";
 inline constexpr const char* kMainHandlerQueueLabel = "com.zorvane.typhorad";
@@ -89,6 +90,9 @@ class TyphoraDaemon final : public IpcListenerDelegate,
                          const IpcReply& reply);
   // IPC: the registry reports changed fonts; every checked-in client is told what it may see.
   void fontChanged(const Value& change, const IpcReply& reply);
+  // The messages of `change`: those of the change being posted, shared by every handler it
+  // reaches, or made for the caller alone. On mainHandlerQueue.
+  std::shared_ptr<FontChangeMessages> fontChangeMessages(const Value& change);
   LocalNotificationCenter& localNotificationCenter() { return localNotificationCenter_; }
   // The handlers of the connections still open.
   std::vector<std::shared_ptr<TyphoraHandler>> liveHandlers();
@@ -326,6 +330,8 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   std::mutex ledgerMutex_;
 
   LocalNotificationCenter localNotificationCenter_;
+  // The font change being posted to the handlers; touched only on mainHandlerQueue.
+  std::shared_ptr<FontChangeMessages> fontChangeMessages_;
   RequestFontsGate requestFontsGate_;
   // The most recent dialog's handler; replaced on mainHandlerQueue by the next dialog.
   std::shared_ptr<MissingFontsDialogHandler> missingFontsDialogHandler_;
