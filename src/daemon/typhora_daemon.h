@@ -18,6 +18,7 @@
 #include "platform/dispatch/serial_queue.h"
 #include "platform/ipc/ipc_listener.h"
 #include "platform/platform.h"
+#include "platform/storage/file_stamp.h"
 #include "platform/value/value.h"
 #include "requests/request_fonts_gate.h"
 
@@ -118,7 +119,8 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   // How many times the cache was dropped.
   std::uint64_t userFontsGeneration();
   bool isUserFontsInfoCached();
-  // Reads the user-fonts file on the update queue: the dictionary, or null.
+  // Reads the user-fonts file on the update queue: the dictionary, or null. A file unchanged since
+  // it was last read (see FileSystem::stampOf) answers the dictionary read then, not decoded again.
   Value _userFontsInfoFromDisk();
   // The daemon's path of the user-fonts file.
   static std::string userFontsFilePath();
@@ -315,6 +317,14 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   std::shared_ptr<const UserFontsNameIndex> userFontsNameIndex_;
   Value enabledUserFontsInfo_;
   std::uint64_t userFontsGeneration_ = 0;  // cache drops so far, for status reports
+  // The information as last decoded from the file and the file's stamp then, kept across drops:
+  // a file that has not changed since is not decoded again. Touched only by jobs on the update
+  // queue.
+  struct UserFontsRead {
+    Value info;
+    std::optional<FileStamp> stamp;
+  };
+  UserFontsRead lastRead_;
 
   // The handlers of accepted connections, pruned as their connections end.
   std::mutex handlersMutex_;

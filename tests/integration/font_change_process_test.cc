@@ -120,5 +120,45 @@ TEST_F(FontChangeProcessTest, EachClassOfClientHearsItsOwnPartOfAChange) {
   EXPECT_THAT(daemon_->output(), HasSubstr("got invalid font path: /tmp/Outside.otf"));
 }
 
+// The file stays as the daemon last read it across a notification, then changes to bytes of the
+// same size: in place, then by rename. Each change is seen; the unchanged file is not decoded.
+TEST_F(FontChangeProcessTest, AChangedFileIsSeenAfterANotificationThatChangedNothing) {
+  auto fonts = [](const std::string& family) {
+    return "{\"" + kShopA + R"(": {"familyName": {"A-Regular": ")" + family + "\"}}}";
+  };
+  replaceUserFonts(fonts("Q"));
+  // The daemon trusts a file's times only once they are older than the clock's coarsest tick.
+  std::this_thread::sleep_for(2100ms);
+  const std::string browser =
+      installApp("browser", "com.example.browser", entitled(R"(["font-enumeration"])"));
+  startDaemon();
+  auto client = watching(browser);  // its check-in reads the file
+
+  change(true, {kShopA});
+  ASSERT_EQ(changesOf(*client, 1).size(), 1u) << client->output();
+  EXPECT_THAT(changesOf(*client, 1)[0], HasSubstr(R"({"A-Regular":"Q"})"));
+  EXPECT_THAT(daemon_->output(), HasSubstr("UserFonts.plist unchanged since it was read"));
+
+  // Written in place with as many bytes: the same inode, new times.
+  std::ofstream(userFonts()) << fonts("R");
+  change(true, {kShopA});
+  ASSERT_EQ(changesOf(*client, 2).size(), 2u) << client->output();
+  EXPECT_THAT(changesOf(*client, 2)[1], HasSubstr(R"({"A-Regular":"R"})"));
+
+  // Once the rewritten file has settled and been read unchanged, renamed over by another.
+  std::this_thread::sleep_for(2100ms);
+  change(true, {kShopA});
+  replaceUserFonts(fonts("S"));
+  change(true, {kShopA});
+  const auto saw = changesOf(*client, 4);
+  ASSERT_EQ(saw.size(), 4u) << client->output();
+  EXPECT_THAT(saw[2], HasSubstr(R"({"A-Regular":"R"})"));
+  EXPECT_THAT(saw[3], HasSubstr(R"({"A-Regular":"S"})"));
+
+  // Everything else still sees a dropped cache: one drop per notification.
+  const auto status = ctl({"status"});
+  EXPECT_THAT(status.out, HasSubstr(R"("generation":4)")) << status.all;
+}
+
 }  // namespace
 }  // namespace typhora::testing
