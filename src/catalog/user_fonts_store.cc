@@ -1,6 +1,7 @@
 // The cached user-fonts information: loaded from the user-fonts file on first read, dropped when
 // fonts change, and read again by the first reader after that.
 #include <string>
+#include <utility>
 
 #include "catalog/font_record.h"
 #include "daemon/typhora_daemon.h"
@@ -52,12 +53,13 @@ void TyphoraDaemon::setUserFontsInfo(Value info) {
   dropEnabledRecords(&enabledUserFontsInfo_);
 }
 
-void TyphoraDaemon::invalidateUserFonts() {
+Value TyphoraDaemon::invalidateUserFonts() {
   std::lock_guard lock(userFontsInfoMutex_);
-  userFontsInfo_ = Value();
+  Value dropped = std::exchange(userFontsInfo_, Value());
   userFontsNameIndex_.reset();
   dropEnabledRecords(&enabledUserFontsInfo_);
   ++userFontsGeneration_;
+  return dropped;
 }
 
 std::uint64_t TyphoraDaemon::userFontsGeneration() {

@@ -18,7 +18,8 @@ constexpr const char* kReceived = "received fontChanged notification.";
 void TyphoraDaemon::fontChanged(const Value& change, const IpcReply& reply) {
   TYLog_Debug(kTYLogTyphoraDaemon, kReceived);
   mainHandlerQueue().async([self = shared_from_this(), change] {
-    self->invalidateUserFonts();
+    // Freed once the clients have been written to.
+    const Value dropped = self->invalidateUserFonts();
     self->fontChangeMessages_ = std::make_shared<FontChangeMessages>(*self, change);
     self->localNotificationCenter().post(kFontChangedName, self->fontChangeMessages_->change());
     self->fontChangeMessages_.reset();
