@@ -8,6 +8,9 @@
 //   flood DIR [BYTES]      sends calls of BYTES (1 MiB) on a raw socket, never reading answers
 //   garbage DIR            sends bytes that are no frame, then a valid call
 //   notes DIR N            N times: connects, sends the one-way note: and closes at once
+//   listen DIR N           stays connected until the service has sent it N note:s, printing each
+//                          note's length; prints "ready" once the service knows it
+//   deaf DIR               connects and never reads; prints "ready" once the service knows it
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
@@ -68,6 +71,22 @@ class UseEndpoint final : public IpcExportedObject {
   LumoService& service_;
 };
 
+// Counts the notes the service sends, printing each one's length.
+class NoteCounter final : public IpcExportedObject {
+ public:
+  explicit NoteCounter(int expected) : left_(expected) {}
+  bool invoke(const IpcOperation& op, const std::vector<Value>& args, IpcReply) override {
+    if (op.wireName != "note:") return false;
+    std::cout << "note " << args[0].asString()->size() << std::endl;
+    if (--left_ == 0) done.signal();
+    return true;
+  }
+  Semaphore done;
+
+ private:
+  int left_;
+};
+
 class Delegate final : public IpcListenerDelegate {
  public:
   explicit Delegate(LumoService& service) : service_(service) {}
@@ -105,6 +124,24 @@ int main(int argc, char** argv) {
       connection->invalidate();
     }
     return 0;
+  }
+  if (mode == "listen" && argc == 4) {
+    auto counter = std::make_shared<NoteCounter>(std::stoi(argv[3]));
+    auto connection = service.connectToService("test.a");
+    connection->setRemoteInterface(lumoTestInterface());
+    connection->setExportedInterface(lumoTestInterface());
+    connection->setExportedObject(counter);
+    connection->resume();
+    callA(service, "echo:reply:", {Value("known")}, &ok);  // answered after this one's accept
+    std::cout << "ready" << std::endl;
+    counter->done.wait();
+    return 0;
+  }
+  if (mode == "deaf") {
+    const int fd = rawConnect(dir);
+    callA(service, "echo:reply:", {Value("known")}, &ok);
+    std::cout << (fd >= 0 ? "ready" : "no connection") << std::endl;
+    pause();
   }
   if (mode == "hang") {
     std::cout << "calling" << std::endl;
