@@ -135,7 +135,7 @@ TEST_F(FontChangeProcessTest, AChangedFileIsSeenAfterANotificationThatChangedNot
   auto client = watching(browser);  // its check-in reads the file
 
   change(true, {kShopA});
-  ASSERT_EQ(changesOf(*client, 1).size(), 1u) << client->output();
+  ASSERT_EQ(changesOf(*client, 1).size(), 1u) << client->output() << daemon_->output();
   EXPECT_THAT(changesOf(*client, 1)[0], HasSubstr(R"({"A-Regular":"Q"})"));
   EXPECT_THAT(daemon_->output(), HasSubstr("UserFonts.plist unchanged since it was read"));
 
