@@ -65,7 +65,7 @@ BenchDevice::BenchDevice(int fonts) {
   fs::create_directories(runtimeDir());
   chmod(runtimeDir().c_str(), 0755);
   const Bytes bytes = CborCodec::encode(userFontsOf(fonts));
-  std::ofstream(root / "var/mobile/Library/UserFonts/UserFonts.plist", std::ios::binary)
+  std::ofstream(userFontsFile(), std::ios::binary)
       .write(reinterpret_cast<const char*>(bytes.data()),
              static_cast<std::streamsize>(bytes.size()));
   const std::string self = fs::canonical("/proc/self/exe").string();
@@ -82,6 +82,19 @@ BenchDevice::~BenchDevice() {
   stop();
   std::error_code ec;
   fs::remove_all(dir_, ec);
+}
+
+std::string BenchDevice::userFontsFile() const {
+  return root() + "/var/mobile/Library/UserFonts/UserFonts.plist";
+}
+
+bool BenchDevice::rewriteUserFonts() const {
+  const std::string file = userFontsFile();
+  const std::string temporary = file + ".rewrite";
+  std::error_code ec;
+  fs::copy_file(file, temporary, fs::copy_options::overwrite_existing, ec);
+  if (!ec) fs::rename(temporary, file, ec);
+  return !ec;
 }
 
 void BenchDevice::spawn() {

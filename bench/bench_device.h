@@ -33,10 +33,16 @@ class BenchDevice {
   void stop();
   pid_t pid() const { return pid_; }
 
+  // Writes the user-fonts file again as the registry does, by rename: the same bytes in a new
+  // file. False when it could not.
+  bool rewriteUserFonts() const;
+
   // A connection to the service with its handshake done.
   std::shared_ptr<IpcConnection> connect(LumoService& service) const;
 
  private:
+  std::string userFontsFile() const;
+
   std::string dir_;
   pid_t pid_ = -1;
 };

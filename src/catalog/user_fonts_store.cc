@@ -1,6 +1,7 @@
 // The cached user-fonts information: loaded from the user-fonts file on first read, dropped when
 // fonts change, and read again by the first reader after that.
 #include <string>
+#include <utility>
 
 #include "catalog/font_record.h"
 #include "daemon/typhora_daemon.h"
@@ -13,6 +14,7 @@ namespace {
 constexpr const char* kMobileHomeFormat = "/var/mobile/%@";
 constexpr const char* kUserFontsFile = "Library/UserFonts/UserFonts.plist";
 constexpr const char* kErrorReading = "error reading %@";
+constexpr const char* kUnchanged = "%@ unchanged since it was read: not decoded again";
 
 // The enabled records and their kept encoding go together.
 void dropEnabledRecords(Value* enabled) {
@@ -51,12 +53,13 @@ void TyphoraDaemon::setUserFontsInfo(Value info) {
   dropEnabledRecords(&enabledUserFontsInfo_);
 }
 
-void TyphoraDaemon::invalidateUserFonts() {
+Value TyphoraDaemon::invalidateUserFonts() {
   std::lock_guard lock(userFontsInfoMutex_);
-  userFontsInfo_ = Value();
+  Value dropped = std::exchange(userFontsInfo_, Value());
   userFontsNameIndex_.reset();
   dropEnabledRecords(&enabledUserFontsInfo_);
   ++userFontsGeneration_;
+  return dropped;
 }
 
 std::uint64_t TyphoraDaemon::userFontsGeneration() {
@@ -103,6 +106,14 @@ Value TyphoraDaemon::_userFontsInfoFromDisk() {
   Value slot;
   updatingUserFonts([this, &slot] {
     const std::string path = userFontsFilePath();
+    const std::optional<FileStamp> stamp = platform_.fileSystem.stampOf(path);
+    // The registry replaces the file by rename: the same stamp is the same bytes, already decoded.
+    if (stamp && lastRead_.stamp == stamp) {
+      TYLog_Debug(kTYLogTyphoraDaemon, kUnchanged, path);
+      slot = lastRead_.info;
+      return;
+    }
+    lastRead_ = {};
     if (!platform_.fileSystem.fileExists(path)) return;
     std::string error;
     std::optional<Value> read = platform_.fileSystem.readPropertyList(path, &error);
@@ -110,6 +121,8 @@ Value TyphoraDaemon::_userFontsInfoFromDisk() {
     // the daemon reads the information as a dictionary of records.
     if (read && read->asDictionary() != nullptr) {
       slot = std::move(*read);
+      // Kept only when the file was the same before and after the read.
+      if (stamp && platform_.fileSystem.stampOf(path) == stamp) lastRead_ = {slot, stamp};
     } else {
       TYLog_Error(kTYLogTyphoraDaemon, kErrorReading, path);
     }

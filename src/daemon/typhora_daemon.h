@@ -18,6 +18,7 @@
 #include "platform/dispatch/serial_queue.h"
 #include "platform/ipc/ipc_listener.h"
 #include "platform/platform.h"
+#include "platform/storage/file_stamp.h"
 #include "platform/value/value.h"
 #include "requests/request_fonts_gate.h"
 
@@ -25,6 +26,7 @@ namespace typhora {
 
 class TyphoraHandler;
 class MissingFontsDialogHandler;
+class FontChangeMessages;
 
 inline constexpr const char* kServiceName = "com.zorvane.typhorad";
 inline constexpr const char* kMainHandlerQueueLabel = "com.zorvane.typhorad";
@@ -89,6 +91,9 @@ class TyphoraDaemon final : public IpcListenerDelegate,
                          const IpcReply& reply);
   // IPC: the registry reports changed fonts; every checked-in client is told what it may see.
   void fontChanged(const Value& change, const IpcReply& reply);
+  // The messages of `change`: those of the change being posted, shared by every handler it
+  // reaches, or made for the caller alone. On mainHandlerQueue.
+  std::shared_ptr<FontChangeMessages> fontChangeMessages(const Value& change);
   LocalNotificationCenter& localNotificationCenter() { return localNotificationCenter_; }
   // The handlers of the connections still open.
   std::vector<std::shared_ptr<TyphoraHandler>> liveHandlers();
@@ -109,12 +114,14 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   // The cached user-fonts information (shared, never copied), or null when there is none.
   Value userFontsInfo();
   void setUserFontsInfo(Value info);
-  // Drops the cache; the next reader loads the file again.
-  void invalidateUserFonts();
+  // Drops the cache; the next reader loads the file again. Answers what was dropped, for a caller
+  // in a hurry to free later (ten thousand records take a millisecond).
+  Value invalidateUserFonts();
   // How many times the cache was dropped.
   std::uint64_t userFontsGeneration();
   bool isUserFontsInfoCached();
-  // Reads the user-fonts file on the update queue: the dictionary, or null.
+  // Reads the user-fonts file on the update queue: the dictionary, or null. A file unchanged since
+  // it was last read (see FileSystem::stampOf) answers the dictionary read then, not decoded again.
   Value _userFontsInfoFromDisk();
   // The daemon's path of the user-fonts file.
   static std::string userFontsFilePath();
@@ -311,6 +318,14 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   std::shared_ptr<const UserFontsNameIndex> userFontsNameIndex_;
   Value enabledUserFontsInfo_;
   std::uint64_t userFontsGeneration_ = 0;  // cache drops so far, for status reports
+  // The information as last decoded from the file and the file's stamp then, kept across drops:
+  // a file that has not changed since is not decoded again. Touched only by jobs on the update
+  // queue.
+  struct UserFontsRead {
+    Value info;
+    std::optional<FileStamp> stamp;
+  };
+  UserFontsRead lastRead_;
 
   // The handlers of accepted connections, pruned as their connections end.
   std::mutex handlersMutex_;
@@ -326,6 +341,8 @@ class TyphoraDaemon final : public IpcListenerDelegate,
   std::mutex ledgerMutex_;
 
   LocalNotificationCenter localNotificationCenter_;
+  // The font change being posted to the handlers; touched only on mainHandlerQueue.
+  std::shared_ptr<FontChangeMessages> fontChangeMessages_;
   RequestFontsGate requestFontsGate_;
   // The most recent dialog's handler; replaced on mainHandlerQueue by the next dialog.
   std::shared_ptr<MissingFontsDialogHandler> missingFontsDialogHandler_;

@@ -67,8 +67,6 @@ class TyphoraHandler final : public IpcExportedObject,
 
  private:
   void observeFontChanges();
-  void userFontsChanged(bool added, const ValueArray& urls);
-  void profileFontsChanged(bool added, const ValueArray& urls);
 
   // The fields are written on the connection's thread and read from mainHandlerQueue and from
   // invalidation handlers on other threads, so one mutex guards them all.

@@ -18,6 +18,11 @@ IpcConnection::CurrentScope::~CurrentScope() {
   currentConnection = std::move(previous_);
 }
 
+void IpcConnection::sendShared(const std::shared_ptr<const IpcSharedMessage>& message,
+                               IpcErrorHandler errorHandler) {
+  remoteObjectProxy(std::move(errorHandler))->call(message->wireName(), message->arguments());
+}
+
 AuditToken currentAuditToken() {
   return currentConnection ? currentConnection->auditToken() : AuditToken{};
 }

@@ -13,6 +13,7 @@
 
 #include "platform/ipc/audit_token.h"
 #include "platform/ipc/ipc_interface.h"
+#include "platform/ipc/ipc_shared_message.h"
 #include "platform/value/value.h"
 
 namespace typhora {
@@ -67,6 +68,10 @@ class IpcConnection : public std::enable_shared_from_this<IpcConnection> {
   virtual std::shared_ptr<IpcRemoteProxy> remoteObjectProxy(IpcErrorHandler errorHandler) = 0;
   virtual std::shared_ptr<IpcRemoteProxy> synchronousRemoteObjectProxy(
       IpcErrorHandler errorHandler) = 0;
+  // Sends `message`, a one-way call of the remote interface that other connections send too, as
+  // an asynchronous proxy would; a layer that can shares one encoding among them.
+  virtual void sendShared(const std::shared_ptr<const IpcSharedMessage>& message,
+                          IpcErrorHandler errorHandler);
 
   // The peer's identity as the kernel told it at connect time.
   virtual AuditToken auditToken() const = 0;

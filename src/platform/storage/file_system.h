@@ -7,6 +7,7 @@
 #include <string_view>
 #include <vector>
 
+#include "platform/storage/file_stamp.h"
 #include "platform/value/value.h"
 
 namespace typhora {
@@ -23,6 +24,12 @@ class FileSystem {
   // One property list (CBOR or JSON) read from the file; nullopt with `error` set on failure.
   virtual std::optional<Value> readPropertyList(const std::string& path,
                                                 std::string* error) const = 0;
+  // The stamp of the regular file at `path`: a later stamp equal to it means the same bytes.
+  // nullopt when there is no such file, when the file changed so recently that a write in place
+  // could still leave its times as they are, or when the file system cannot tell.
+  virtual std::optional<FileStamp> stampOf(const std::string& /*path*/) const {
+    return std::nullopt;
+  }
   // Removes the file or directory at `path`, with everything below a directory; false with
   // `error` set when it could not.
   virtual bool removeItem(const std::string& path, std::string* error) = 0;

@@ -8,6 +8,7 @@
 
 #include <cerrno>
 #include <cstring>
+#include <ctime>
 
 #include "platform/log/log.h"
 #include "platform/value/plist_reader.h"
@@ -128,6 +129,22 @@ bool LinuxFileSystem::fileExists(const std::string& path) const {
 std::optional<Value> LinuxFileSystem::readPropertyList(const std::string& path,
                                                        std::string* error) const {
   return PlistReader::readFile(onDisk(path), {}, error);
+}
+
+std::optional<FileStamp> LinuxFileSystem::stampOf(const std::string& path) const {
+  timespec now{};
+  clock_gettime(CLOCK_REALTIME, &now);
+  struct stat info {};
+  if (stat(onDisk(path).c_str(), &info) != 0 || !S_ISREG(info.st_mode)) return std::nullopt;
+  // Taken before the caller reads the file: a write after that read gets later times.
+  if (info.st_ctim.tv_sec >= now.tv_sec - 1) return std::nullopt;
+  return FileStamp{static_cast<std::uint64_t>(info.st_dev),
+                   static_cast<std::uint64_t>(info.st_ino),
+                   static_cast<std::int64_t>(info.st_size),
+                   info.st_mtim.tv_sec,
+                   info.st_mtim.tv_nsec,
+                   info.st_ctim.tv_sec,
+                   info.st_ctim.tv_nsec};
 }
 
 bool LinuxFileSystem::removeItem(const std::string& path, std::string* error) {

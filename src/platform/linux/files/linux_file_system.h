@@ -19,6 +19,9 @@ class LinuxFileSystem final : public FileSystem {
   explicit LinuxFileSystem(std::string root);
   bool fileExists(const std::string& path) const override;
   std::optional<Value> readPropertyList(const std::string& path, std::string* error) const override;
+  // File times tick coarsely (by the clock's tick, by the second on some file systems): a file
+  // changed in the last second or two has no stamp yet.
+  std::optional<FileStamp> stampOf(const std::string& path) const override;
   bool removeItem(const std::string& path, std::string* error) override;
   bool removeEmptyDirectory(const std::string& path, std::string* error) override;
   std::optional<std::vector<std::string>> contentsOfDirectory(

@@ -75,6 +75,9 @@ class LumoConnection final : public IpcConnection {
   std::shared_ptr<IpcRemoteProxy> remoteObjectProxy(IpcErrorHandler errorHandler) override;
   std::shared_ptr<IpcRemoteProxy> synchronousRemoteObjectProxy(
       IpcErrorHandler errorHandler) override;
+  // Queues the message's one frame, encoded by the first connection that sends it.
+  void sendShared(const std::shared_ptr<const IpcSharedMessage>& message,
+                  IpcErrorHandler errorHandler) override;
   // The pinned peer. On a connection this process opened, the peer is known once its Hello has
   // come: this waits for it (or for the connection's end, or the handshake's time limit).
   AuditToken auditToken() const override;
@@ -122,6 +125,7 @@ class LumoConnection final : public IpcConnection {
   std::optional<LumoMessage> decode(LumoRawFrame frame, std::string* error);
   // Any thread.
   bool send(const LumoMessage& message, std::string* error);
+  bool sendFrame(std::unique_ptr<Outgoing> out, std::string* error);
   bool enqueueLocked(std::unique_ptr<Outgoing> out, bool first, std::string* error);
   bool flushLocked(std::string* error);
   // Cuts the peer off unless some of its piled answers have gone out by then.

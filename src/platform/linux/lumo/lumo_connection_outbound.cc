@@ -43,6 +43,10 @@ bool LumoConnection::send(const LumoMessage& message, std::string* error) {
   const bool encoded = encodeLumoFrame(message, &out->bytes, &fds, fdOf, error);
   for (int fd : fds) out->fds.emplace_back(fd);
   if (!encoded) return false;
+  return sendFrame(std::move(out), error);
+}
+
+bool LumoConnection::sendFrame(std::unique_ptr<Outgoing> out, std::string* error) {
   bool cutOff = false;
   {
     std::lock_guard lock(mutex_);
@@ -60,7 +64,7 @@ bool LumoConnection::send(const LumoMessage& message, std::string* error) {
 }
 
 bool LumoConnection::enqueueLocked(std::unique_ptr<Outgoing> out, bool first, std::string* error) {
-  const std::size_t size = out->bytes.size();
+  const std::size_t size = out->frame().size();
   if (outboundBytes_ + size > kOutboundLimit) return false;
   // Many peers that do not read could each pile answers up to the connection's limit: past the
   // process's bound, one whose pile this answer would grow is cut off rather than given more. A
@@ -96,7 +100,8 @@ bool LumoConnection::flushLocked(std::string* error) {
   const bool held = outgoing_ && handshake_ != Handshake::Done;
   while (!outbound_.empty() && !held) {
     Outgoing& front = *outbound_.front();
-    iovec iov{front.bytes.data() + front.offset, front.bytes.size() - front.offset};
+    const std::vector<std::uint8_t>& bytes = front.frame();
+    iovec iov{const_cast<std::uint8_t*>(bytes.data()) + front.offset, bytes.size() - front.offset};
     msghdr msg{};
     msg.msg_iov = &iov;
     msg.msg_iovlen = 1;
@@ -116,9 +121,9 @@ bool LumoConnection::flushLocked(std::string* error) {
     front.fds.clear();  // the descriptors went with the first byte
     front.offset += static_cast<std::size_t>(n);
     outboundSent_ += static_cast<std::size_t>(n);
-    if (front.offset == front.bytes.size()) {
-      outboundBytes_ -= front.bytes.size();
-      LumoAdmission::shared().addOutbound(-static_cast<std::ptrdiff_t>(front.bytes.size()));
+    if (front.offset == bytes.size()) {
+      outboundBytes_ -= bytes.size();
+      LumoAdmission::shared().addOutbound(-static_cast<std::ptrdiff_t>(bytes.size()));
       outbound_.pop_front();
     }
   }

@@ -28,8 +28,11 @@ struct LumoConnection::Pending {
 
 struct LumoConnection::Outgoing {
   std::vector<std::uint8_t> bytes;
-  std::vector<UniqueFd> fds;  // sent beside the first byte, then closed
+  IpcSharedMessage::Encoding shared;  // instead of `bytes`: a frame other connections send too
+  std::vector<UniqueFd> fds;          // sent beside the first byte, then closed
   std::size_t offset = 0;
+
+  const std::vector<std::uint8_t>& frame() const { return shared ? *shared : bytes; }
 };
 
 namespace lumo_detail {

@@ -11,6 +11,9 @@
 //   callers DIR T N        on one connection, T threads each make N synchronous count:reply:
 //                          calls while one more thread makes asynchronous ones; prints the
 //                          number of wrong or missing answers
+//   listen DIR N           stays connected until the service has sent it N note:s, printing each
+//                          note's length; prints "ready" once the service knows it
+//   deaf DIR               connects and never reads; prints "ready" once the service knows it
 #include <sys/socket.h>
 #include <sys/un.h>
 #include <unistd.h>
@@ -70,6 +73,22 @@ class UseEndpoint final : public IpcExportedObject {
 
  private:
   LumoService& service_;
+};
+
+// Counts the notes the service sends, printing each one's length.
+class NoteCounter final : public IpcExportedObject {
+ public:
+  explicit NoteCounter(int expected) : left_(expected) {}
+  bool invoke(const IpcOperation& op, const std::vector<Value>& args, IpcReply) override {
+    if (op.wireName != "note:") return false;
+    std::cout << "note " << args[0].asString()->size() << std::endl;
+    if (--left_ == 0) done.signal();
+    return true;
+  }
+  Semaphore done;
+
+ private:
+  int left_;
 };
 
 class Delegate final : public IpcListenerDelegate {
@@ -145,6 +164,24 @@ int main(int argc, char** argv) {
     connection->invalidate();
     std::cout << wrong.load() << std::endl;
     return wrong == 0 ? 0 : 1;
+  }
+  if (mode == "listen" && argc == 4) {
+    auto counter = std::make_shared<NoteCounter>(std::stoi(argv[3]));
+    auto connection = service.connectToService("test.a");
+    connection->setRemoteInterface(lumoTestInterface());
+    connection->setExportedInterface(lumoTestInterface());
+    connection->setExportedObject(counter);
+    connection->resume();
+    callA(service, "echo:reply:", {Value("known")}, &ok);  // answered after this one's accept
+    std::cout << "ready" << std::endl;
+    counter->done.wait();
+    return 0;
+  }
+  if (mode == "deaf") {
+    const int fd = rawConnect(dir);
+    callA(service, "echo:reply:", {Value("known")}, &ok);
+    std::cout << (fd >= 0 ? "ready" : "no connection") << std::endl;
+    pause();
   }
   if (mode == "hang") {
     std::cout << "calling" << std::endl;

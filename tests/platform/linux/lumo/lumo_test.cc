@@ -7,6 +7,7 @@
 
 #include <atomic>
 #include <filesystem>
+#include <mutex>
 #include <thread>
 
 #include "integration/child_process.h"
@@ -52,6 +53,11 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
   };
 
   bool shouldAcceptNewConnection(IpcListener&, std::shared_ptr<IpcConnection> c) override {
+    {
+      std::lock_guard lock(mutex_);
+      accepted_.push_back(c);
+    }
+    c->setRemoteInterface(lumoTestInterface());
     c->setExportedInterface(lumoTestInterface());
     c->setExportedObject(std::make_shared<Object>(shared_from_this()));
     c->setInvalidationHandler([self = shared_from_this()] {
@@ -63,6 +69,11 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
     return true;
   }
 
+  std::vector<std::shared_ptr<IpcConnection>> connections() {
+    std::lock_guard lock(mutex_);
+    return accepted_;
+  }
+
   LumoService& service_;
   std::shared_ptr<IpcListener> anonymous;
   std::atomic<int> accepted{0};
@@ -71,6 +82,10 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
   Semaphore hung;
   Semaphore noted;
   AuditToken lastCaller;
+
+ private:
+  std::mutex mutex_;
+  std::vector<std::shared_ptr<IpcConnection>> accepted_;
 };
 
 class LumoTest : public ::testing::Test {
@@ -200,6 +215,31 @@ TEST_F(LumoTest, APeerThatStopsReadingIsCutOffWhileOthersAreAnswered) {
   EXPECT_EQ(answered.load(), 10);
   for (int i = 0; i < 1000 && !log.contains("cut off"); ++i) std::this_thread::sleep_for(10ms);
   EXPECT_TRUE(log.contains("the peer stopped reading; cut off")) << flood.output();
+}
+
+// One one-way message for every peer, its frame queued on each connection: every peer that reads
+// gets every copy, and one that never reads piles them up and is cut off alone.
+TEST_F(LumoTest, AMessageSentToEveryPeerReachesTheReadersWhileOneThatStopsReadingIsCutOff) {
+  testing::LogCapture log;
+  ChildProcess deaf(peer({"deaf"}));
+  ASSERT_TRUE(deaf.waitForLine("ready", 20s)) << deaf.output();
+  constexpr int kNotes = 48;
+  ChildProcess first(peer({"listen", std::to_string(kNotes)}));
+  ChildProcess second(peer({"listen", std::to_string(kNotes)}));
+  ASSERT_TRUE(first.waitForLine("ready", 20s)) << first.output();
+  ASSERT_TRUE(second.waitForLine("ready", 20s)) << second.output();
+  const auto note = std::make_shared<const IpcSharedMessage>(
+      "note:", std::vector<Value>{Value(std::string(64u << 10, 'n'))});
+  for (int i = 0; i < kNotes; ++i) {
+    // The peers' finished echo calls have gone: sending to them fails and changes nothing.
+    for (const auto& connection : server_->connections()) connection->sendShared(note, {});
+  }
+  EXPECT_EQ(first.waitFor(30s), 0) << first.output();
+  EXPECT_EQ(second.waitFor(30s), 0) << second.output();
+  EXPECT_EQ(first.countLines("note 65536"), static_cast<std::size_t>(kNotes));
+  EXPECT_EQ(second.countLines("note 65536"), static_cast<std::size_t>(kNotes));
+  for (int i = 0; i < 1000 && !log.contains("cut off"); ++i) std::this_thread::sleep_for(10ms);
+  EXPECT_TRUE(log.contains("the peer stopped reading; cut off")) << deaf.output();
 }
 
 TEST_F(LumoTest, AnswersPiledForPeersThatDoNotReadAreBoundedAcrossConnections) {
