@@ -31,6 +31,14 @@ std::optional<Value> PlistReader::read(std::span<const std::uint8_t> bytes,
   return CborCodec::decode(bytes, limits, nullptr, error);
 }
 
+bool PlistReader::decodes(std::span<const std::uint8_t> bytes, const DecodeLimits& limits,
+                          std::string* error) {
+  if (detect(bytes) == Format::Json) return read(bytes, limits, error).has_value();
+  // The value is dropped before `bytes` can go: an owner that owns nothing is enough.
+  const std::shared_ptr<const void> borrowed(std::shared_ptr<const void>(), bytes.data());
+  return CborCodec::decodeLazily(borrowed, bytes, limits, nullptr, error).has_value();
+}
+
 namespace {
 
 // The bytes of a file, in memory mapped and populated in one call: a large file read into a

@@ -20,6 +20,10 @@ class PlistReader {
 
   static std::optional<Value> read(std::span<const std::uint8_t> bytes,
                                    const DecodeLimits& limits = {}, std::string* error = nullptr);
+  // Whether `bytes` decode, as read() would decide, without building what a CBOR input's large
+  // arrays and dictionaries hold.
+  static bool decodes(std::span<const std::uint8_t> bytes, const DecodeLimits& limits = {},
+                      std::string* error = nullptr);
   // nullopt when the file cannot be opened or read, or does not decode; `error` says which.
   static std::optional<Value> readFile(const std::string& path, const DecodeLimits& limits = {},
                                        std::string* error = nullptr);

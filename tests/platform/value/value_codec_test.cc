@@ -2,6 +2,7 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <cmath>
 #include <cstdio>
 #include <filesystem>
@@ -250,6 +251,29 @@ TEST(PlistReader, ReadsEitherEncodingFromAFile) {
   EXPECT_THAT(error, HasSubstr("cannot open"));
   std::remove(json.c_str());
   std::remove(cbor.c_str());
+}
+
+// The start-up check of state files: it decides as a read would, also for a fault deep inside a
+// large dictionary that it does not build.
+TEST(PlistReader, TellsWhetherBytesDecodeAsAReadWould) {
+  std::vector<DictionaryEntry> records;
+  for (int i = 0; i < 2000; ++i)
+    records.emplace_back("/fonts/Font" + std::to_string(i) + ".otf",
+                         Value::dictionary({{"familyName", "Font " + std::to_string(i)}}));
+  Bytes good = CborCodec::encode(Value(Dictionary(std::move(records))));
+  EXPECT_TRUE(PlistReader::decodes(good));
+  Bytes bad = good;
+  const std::string needle = "Font 1500";
+  auto at = std::search(bad.begin(), bad.end(), needle.begin(), needle.end());
+  ASSERT_NE(at, bad.end());
+  *at = 0xff;  // not UTF-8
+  std::string readError, checkError;
+  EXPECT_FALSE(PlistReader::read(bad, {}, &readError));
+  EXPECT_FALSE(PlistReader::decodes(bad, {}, &checkError));
+  EXPECT_EQ(checkError, readError);
+  const std::string junk = "{\"open\": ";
+  EXPECT_FALSE(
+      PlistReader::decodes({reinterpret_cast<const std::uint8_t*>(junk.data()), junk.size()}));
 }
 
 }  // namespace

@@ -49,7 +49,7 @@ std::optional<std::string> CorruptFileQuarantine::setAsideIfUndecodable(const st
     std::optional<std::vector<std::uint8_t>> bytes =
         RegularFile::read(path, kMaxStateFileBytes, &error);
     if (!bytes) return std::nullopt;  // unreadable now is not proof of damage
-    if (PlistReader::read(*bytes, {}, &error)) return std::nullopt;
+    if (PlistReader::decodes(*bytes, {}, &error)) return std::nullopt;
     why = error;
   }
   const std::string aside = path + ".corrupt-" + std::to_string(std::time(nullptr));
