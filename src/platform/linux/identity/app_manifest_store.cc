@@ -1,15 +1,12 @@
 #include "platform/linux/identity/app_manifest_store.h"
 
 #include <fcntl.h>
-#include <openssl/evp.h>
 #include <sodium.h>
 #include <unistd.h>
 
 #include <algorithm>
 #include <array>
 #include <filesystem>
-#include <memory>
-#include <vector>
 
 #include "platform/fd/unique_fd.h"
 #include "platform/linux/files/device_root.h"
@@ -24,26 +21,21 @@ namespace {
 constexpr std::size_t kMaxManifests = 4096;
 constexpr std::size_t kMaxCachedDigests = 1024;
 
-// The program's digest is read at a process's first check-in, on the caller's path: libcrypto's
-// SHA-256 uses the processor's hashing instructions where they exist (several times libsodium's).
 std::optional<std::string> sha256Hex(int fd) {
-  std::unique_ptr<EVP_MD_CTX, decltype(&EVP_MD_CTX_free)> context(EVP_MD_CTX_new(),
-                                                                  &EVP_MD_CTX_free);
-  if (!context || EVP_DigestInit_ex(context.get(), EVP_sha256(), nullptr) != 1) return std::nullopt;
-  std::vector<unsigned char> buffer(1 << 18);
+  crypto_hash_sha256_state state;
+  crypto_hash_sha256_init(&state);
+  std::array<unsigned char, 1 << 16> buffer{};
   for (;;) {
     ssize_t n = read(fd, buffer.data(), buffer.size());
     if (n < 0 && errno == EINTR) continue;
     if (n < 0) return std::nullopt;
     if (n == 0) break;
-    if (EVP_DigestUpdate(context.get(), buffer.data(), static_cast<std::size_t>(n)) != 1)
-      return std::nullopt;
+    crypto_hash_sha256_update(&state, buffer.data(), static_cast<unsigned long long>(n));
   }
-  std::array<unsigned char, EVP_MAX_MD_SIZE> digest{};
-  unsigned int size = 0;
-  if (EVP_DigestFinal_ex(context.get(), digest.data(), &size) != 1) return std::nullopt;
-  std::array<char, EVP_MAX_MD_SIZE * 2 + 1> hex{};
-  sodium_bin2hex(hex.data(), hex.size(), digest.data(), size);
+  std::array<unsigned char, crypto_hash_sha256_BYTES> digest{};
+  crypto_hash_sha256_final(&state, digest.data());
+  std::array<char, crypto_hash_sha256_BYTES * 2 + 1> hex{};
+  sodium_bin2hex(hex.data(), hex.size(), digest.data(), digest.size());
   return std::string(hex.data());
 }
 
