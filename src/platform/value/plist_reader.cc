@@ -77,16 +77,15 @@ std::optional<Value> PlistReader::readFile(const std::string& path, const Decode
   std::size_t size = 0;
   UniqueFd fd = RegularFile::open(path, limits.maxBytes, &size, error);
   if (!fd.valid()) return std::nullopt;
-  auto buffer = std::make_shared<FileBytes>(size);
-  if (!buffer->valid()) return failWith("cannot read: out of memory");
+  FileBytes buffer(size);
+  if (!buffer.valid()) return failWith("cannot read: out of memory");
   std::size_t done = 0;
-  if (!RegularFile::readInto(fd.get(), buffer->span(), &done, error)) return std::nullopt;
-  const std::span<const std::uint8_t> bytes = buffer->span().first(done);
+  if (!RegularFile::readInto(fd.get(), buffer.span(), &done, error)) return std::nullopt;
+  const std::span<const std::uint8_t> bytes = buffer.span().first(done);
   std::string why;
-  // Large arrays and dictionaries of a CBOR file stay encoded in the buffer until read.
-  auto value = detect(bytes) == Format::Cbor
-                   ? CborCodec::decodeLazily(std::move(buffer), bytes, limits, nullptr, &why)
-                   : read(bytes, limits, &why);
+  // Decoded whole: a file's value is usually kept (the daemon's caches) and walked in full, and a
+  // part left encoded would keep the whole file's buffer with it.
+  auto value = read(bytes, limits, &why);
   if (!value) return failWith("cannot decode: " + why);
   return value;
 }
