@@ -208,7 +208,8 @@ void Comparison::fanout() {
   LumoService service(device.runtimeDir());
   auto connection = device.connect(service);
   bench::checkIn(connection);
-  std::this_thread::sleep_for(std::chrono::seconds(2));
+  // As long as after the crowd below: the heap trim gives back the first answer's copies alike.
+  std::this_thread::sleep_for(std::chrono::seconds(6));
   const long before = procStatusField(device.pid(), "VmRSS:");
   FanoutCrowd crowd(device.runtimeDir(), kClients, kProcesses);
   if (!crowd.ready()) {

@@ -1,9 +1,8 @@
-// CBOR through libcbor's encoder: Values are written directly, never through a second tree.
+// CBOR written straight from Values (shortest heads, doubles in eight bytes), never through a
+// second tree: a per-item library call cost more than the encoding itself.
 // Decoding is a validating scan and a reader of what it took; anything else goes to libcbor's
 // streaming decoder (CborStreamDecoder).
 #include "platform/value/cbor_codec.h"
-
-#include <cbor.h>
 
 #include <algorithm>
 #include <cmath>
@@ -20,6 +19,14 @@ namespace typhora {
 namespace {
 
 constexpr std::uint64_t kDateTag = 1;
+// Major types.
+constexpr std::uint8_t kUnsigned = 0;
+constexpr std::uint8_t kNegative = 1;
+constexpr std::uint8_t kByteString = 2;
+constexpr std::uint8_t kText = 3;
+constexpr std::uint8_t kArray = 4;
+constexpr std::uint8_t kMap = 5;
+constexpr std::uint8_t kTag = 6;
 
 // ---- Encoding ----
 
@@ -80,29 +87,28 @@ class Encoder {
     if (const LazyContainer* lazy = value.lazyContainer()) return copy(*lazy, depth);
     switch (value.type()) {
       case Value::Type::Null:
-        return put(cbor_encode_null);
+        return simple(0xf6);
       case Value::Type::Bool:
-        return put(cbor_encode_bool, *value.asBool());
+        return simple(*value.asBool() ? 0xf5 : 0xf4);
       case Value::Type::Int: {
         std::int64_t i = *value.asInt();
-        if (i >= 0) return put(cbor_encode_uint, static_cast<std::uint64_t>(i));
-        return put(cbor_encode_negint, static_cast<std::uint64_t>(-(i + 1)));
+        if (i >= 0) return head(kUnsigned, static_cast<std::uint64_t>(i));
+        return head(kNegative, static_cast<std::uint64_t>(-(i + 1)));
       }
       case Value::Type::UInt:
-        return put(cbor_encode_uint, *value.asUInt());
+        return head(kUnsigned, *value.asUInt());
       case Value::Type::Double:
-        return put(cbor_encode_double, *value.asDouble());
+        return real(*value.asDouble());
       case Value::Type::String:
-        return bytes(cbor_encode_string_start, *value.asString());
+        return bytes(kText, *value.asString());
       case Value::Type::Data:
-        return bytes(cbor_encode_bytestring_start, *value.asData());
+        return bytes(kByteString, *value.asData());
       case Value::Type::Date:
-        return put(cbor_encode_tag, kDateTag) &&
-               put(cbor_encode_double, value.asDate()->secondsSince1970);
+        return head(kTag, kDateTag) && real(value.asDate()->secondsSince1970);
       case Value::Type::Array: {
         const ValueArray& array = *value.asArray();
         return shared(&array, array.size(), depth, [&] {
-          if (!put(cbor_encode_array_start, array.size())) return false;
+          if (!head(kArray, array.size())) return false;
           for (const Value& item : array) {
             if (!encode(item, depth + 1)) return false;
           }
@@ -112,9 +118,9 @@ class Encoder {
       case Value::Type::Dictionary: {
         const Dictionary& dict = *value.asDictionary();
         return shared(&dict, dict.size(), depth, [&] {
-          if (!put(cbor_encode_map_start, dict.size())) return false;
+          if (!head(kMap, dict.size())) return false;
           for (const auto& [key, item] : dict) {
-            if (!bytes(cbor_encode_string_start, key) || !encode(item, depth + 1)) return false;
+            if (!bytes(kText, key) || !encode(item, depth + 1)) return false;
           }
           return true;
         });
@@ -175,20 +181,50 @@ class Encoder {
     }
   }
 
-  template <class F, class... A>
-  bool put(F encodeFn, A... args) {
-    ensure(9);
-    std::size_t at = out_.size();
-    out_.resize(at + 9);
-    std::size_t n = encodeFn(args..., out_.data() + at, 9);
-    out_.resize(at + n);
-    return n > 0 || fail("encoder failed");
+  // A head in its shortest form: the major type and its argument, big-endian.
+  bool head(std::uint8_t major, std::uint64_t argument) {
+    std::uint8_t bytes[9];
+    std::size_t size = 1;
+    if (argument < 24) {
+      bytes[0] = static_cast<std::uint8_t>(major << 5 | argument);
+    } else {
+      const int width = argument <= 0xff         ? 1
+                        : argument <= 0xffff     ? 2
+                        : argument <= 0xffffffff ? 4
+                                                 : 8;
+      bytes[0] = static_cast<std::uint8_t>(major << 5 | (width == 1   ? 24
+                                                         : width == 2 ? 25
+                                                         : width == 4 ? 26
+                                                                      : 27));
+      for (int i = width; i > 0; --i, argument >>= 8)
+        bytes[i] = static_cast<std::uint8_t>(argument);
+      size += static_cast<std::size_t>(width);
+    }
+    ensure(size);
+    out_.insert(out_.end(), bytes, bytes + size);
+    return true;
+  }
+
+  bool simple(std::uint8_t initial) {
+    ensure(1);
+    out_.push_back(initial);
+    return true;
+  }
+
+  // Doubles always in eight bytes, as decoders of this system expect them.
+  bool real(double value) {
+    std::uint64_t bits = 0;
+    std::memcpy(&bits, &value, sizeof bits);
+    std::uint8_t bytes[9] = {0xfb};
+    for (int i = 8; i > 0; --i, bits >>= 8) bytes[i] = static_cast<std::uint8_t>(bits);
+    ensure(sizeof bytes);
+    out_.insert(out_.end(), bytes, bytes + sizeof bytes);
+    return true;
   }
 
   template <class Container>
-  bool bytes(std::size_t (*start)(std::size_t, unsigned char*, std::size_t),
-             const Container& content) {
-    if (!put(start, content.size())) return false;
+  bool bytes(std::uint8_t major, const Container& content) {
+    head(major, content.size());
     ensure(content.size());
     out_.insert(out_.end(), reinterpret_cast<const std::uint8_t*>(content.data()),
                 reinterpret_cast<const std::uint8_t*>(content.data()) + content.size());
@@ -200,7 +236,7 @@ class Encoder {
     if (hooks_ == nullptr || !hooks_->toIndex) return fail("an endpoint cannot be encoded here");
     std::optional<std::uint64_t> index = hooks_->toIndex(ep);
     if (!index) return fail("the endpoint could not be passed");
-    return put(cbor_encode_tag, kCborEndpointTag) && put(cbor_encode_uint, *index);
+    return head(kTag, kCborEndpointTag) && head(kUnsigned, *index);
   }
 
   bool fail(const char* why) {

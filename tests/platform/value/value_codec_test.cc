@@ -146,6 +146,39 @@ TEST(Codecs, JsonSpecialFormsAndDates) {
   EXPECT_FALSE(JsonCodec::decode(R"({"$data": "!!!"})", {}, &error));
 }
 
+// Heads in their shortest form at every width's edge, and the other encodings byte for byte.
+TEST(Codecs, CborEncodingsAreTheStandardsOwn) {
+  auto hex = [](const Value& v) {
+    std::string out;
+    char byte[3];
+    for (std::uint8_t b : CborCodec::encode(v)) {
+      std::snprintf(byte, sizeof byte, "%02x", b);
+      out += byte;
+    }
+    return out;
+  };
+  EXPECT_EQ(hex(Value(0)), "00");
+  EXPECT_EQ(hex(Value(23)), "17");
+  EXPECT_EQ(hex(Value(24)), "1818");
+  EXPECT_EQ(hex(Value(255)), "18ff");
+  EXPECT_EQ(hex(Value(256)), "190100");
+  EXPECT_EQ(hex(Value(65536)), "1a00010000");
+  EXPECT_EQ(hex(Value(std::int64_t{1'000'000'000'000})), "1b000000e8d4a51000");
+  EXPECT_EQ(hex(Value(std::numeric_limits<std::uint64_t>::max())), "1bffffffffffffffff");
+  EXPECT_EQ(hex(Value(-1)), "20");
+  EXPECT_EQ(hex(Value(-1000)), "3903e7");
+  EXPECT_EQ(hex(Value(std::numeric_limits<std::int64_t>::min())), "3b7fffffffffffffff");
+  EXPECT_EQ(hex(Value(1.1)), "fb3ff199999999999a");
+  EXPECT_EQ(hex(Value(Date{0})), "c1fb0000000000000000");
+  EXPECT_EQ(hex(Value(false)), "f4");
+  EXPECT_EQ(hex(Value(true)), "f5");
+  EXPECT_EQ(hex(Value()), "f6");
+  EXPECT_EQ(hex(Value("a")), "6161");
+  EXPECT_EQ(hex(Value(Bytes{1, 2})), "420102");
+  EXPECT_EQ(hex(Value::array({1, Value::array({})})), "820180");
+  EXPECT_EQ(hex(Value::dictionary({{"a", 1}})), "a1616101");
+}
+
 TEST(Codecs, NestingIsLimitedExactlyAtTheLimit) {
   DecodeLimits limits;
   limits.maxDepth = 8;
