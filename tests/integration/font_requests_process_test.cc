@@ -202,9 +202,11 @@ class FontPickerProcessTest : public FontRequestsProcessTest {
     startDaemon();
   }
   CommandResult pick(const std::string& client, const std::string& name) const {
-    return runCommand(
-        {client, "--runtime-dir", runtime_, "picker-client", "--picker", picker_, "--name", name},
-        30s);
+    return runCommand(pickCommand(client, name), 30s);
+  }
+  std::vector<std::string> pickCommand(const std::string& client, const std::string& name) const {
+    return {client,     "--runtime-dir", runtime_, "picker-client",
+            "--picker", picker_,         "--name", name};
   }
   std::string client_, picker_;
 };
@@ -236,6 +238,25 @@ TEST_F(FontPickerProcessTest, TheDeliveryIsRecordedForTheSignedClientOnly) {
   EXPECT_EQ(preferences().get("issues"),
             Value::dictionary({{"com.example.client", Value::array({"U/com.example.shop/A.otf"})}}))
       << preferences().description();
+}
+
+// The daemon's thread that delivers the fonts waits for the client's answer reading the client's
+// socket itself: a client that never answers is cut off after its time, and the daemon serves
+// everyone else meanwhile.
+TEST_F(FontPickerProcessTest, AClientThatNeverAnswersIsCutOffAndOthersAreServedMeanwhile) {
+  std::vector<std::string> command = pickCommand(client_, "A-Regular");
+  command.push_back("--silent");
+  ChildProcess silent(command);
+  ASSERT_TRUE(silent.waitForLine("\"activate\"", 20s)) << daemon_->output();
+  const auto start = std::chrono::steady_clock::now();
+  auto checkin = runCommand({client_, "--runtime-dir", runtime_, "call", "checkin:"}, 20s);
+  EXPECT_EQ(checkin.status, 0) << checkin.all;
+  EXPECT_LT(std::chrono::steady_clock::now() - start, 5s);
+  auto delivered = pick(client_, "A-Regular");  // a second pick, answered, meanwhile
+  EXPECT_THAT(delivered.out, HasSubstr("[true]")) << delivered.all;
+  silent.wait();
+  silent.finishOutput();
+  EXPECT_THAT(silent.standardOutput(), HasSubstr("[false]")) << daemon_->output();
 }
 
 }  // namespace

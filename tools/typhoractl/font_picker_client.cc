@@ -26,7 +26,7 @@ bool FontPickerClient::invoke(const IpcOperation& operation, const std::vector<V
   std::cout << JsonCodec::encode(Value::dictionary(
                    {{"role", "font-picker-client"}, {"activate", arguments.at(0)}}))
             << std::endl;
-  reply({Value(activates_)});
+  if (!silent_) reply({Value(activates_)});
   return true;
 }
 

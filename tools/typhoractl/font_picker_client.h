@@ -13,7 +13,8 @@ class FontPickerClient final : public IpcListenerDelegate,
                                public IpcExportedObject,
                                public std::enable_shared_from_this<FontPickerClient> {
  public:
-  explicit FontPickerClient(bool activates) : activates_(activates) {}
+  // Answers activations with `activates`, or never when `silent` (a client that hangs).
+  FontPickerClient(bool activates, bool silent) : activates_(activates), silent_(silent) {}
   bool shouldAcceptNewConnection(IpcListener& listener,
                                  std::shared_ptr<IpcConnection> connection) override;
   bool invoke(const IpcOperation& operation, const std::vector<Value>& arguments,
@@ -22,6 +23,7 @@ class FontPickerClient final : public IpcListenerDelegate,
 
  private:
   const bool activates_;
+  const bool silent_;
   std::atomic<int> activations_{0};
 };
 

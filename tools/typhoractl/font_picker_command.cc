@@ -14,12 +14,12 @@ namespace typhora::ctl {
 namespace {
 
 constexpr const char* kClientUsage =
-    "usage: typhoractl picker-client --picker PROGRAM --name POSTSCRIPT-NAME [--refuse]\n"
+    "usage: typhoractl picker-client --picker PROGRAM --name POSTSCRIPT-NAME [--refuse|--silent]\n"
     "\n"
     "Plays an application that uses the font picker: offers the font-picker client interface\n"
     "on an endpoint, starts 'PROGRAM pick POSTSCRIPT-NAME' with it as descriptor 3 (PROGRAM is a\n"
     "copy of typhoractl: the picker) and prints the fonts the daemon delivers, answering true\n"
-    "(false with --refuse). Exits with the picker's status.\n";
+    "(false with --refuse, never with --silent). Exits with the picker's status.\n";
 constexpr const char* kPickUsage =
     "usage: typhoractl pick POSTSCRIPT-NAME\n"
     "\n"
@@ -33,6 +33,7 @@ int runPickerClientCommand(const ClientOptions& options, const std::vector<std::
   std::string picker;
   std::string name;
   bool activates = true;
+  bool silent = false;
   for (std::size_t i = 0; i < args.size(); ++i) {
     const bool hasValue = i + 1 < args.size();
     if (args[i] == "--help" || args[i] == "-h") {
@@ -45,6 +46,8 @@ int runPickerClientCommand(const ClientOptions& options, const std::vector<std::
       name = args[++i];
     } else if (args[i] == "--refuse") {
       activates = false;
+    } else if (args[i] == "--silent") {
+      silent = true;
     } else {
       std::cerr << "typhoractl: unexpected argument '" << args[i] << "'\n" << kClientUsage;
       return 2;
@@ -55,7 +58,7 @@ int runPickerClientCommand(const ClientOptions& options, const std::vector<std::
     return 2;
   }
   LumoService service(options.runtimeDir);
-  auto client = std::make_shared<FontPickerClient>(activates);
+  auto client = std::make_shared<FontPickerClient>(activates, silent);
   auto listener = service.makeAnonymousListener();
   const auto* endpoint =
       listener ? dynamic_cast<const LumoEndpoint*>(listener->endpoint().get()) : nullptr;
