@@ -9,6 +9,7 @@
 #include <charconv>
 
 #include "platform/fd/unique_fd.h"
+#include "platform/linux/identity/pinned_processes.h"
 
 namespace typhora {
 namespace {
@@ -19,16 +20,19 @@ namespace {
 class ProcDirectory {
  public:
   explicit ProcDirectory(pid_t pid)
-      : fd_(pid > 0
-                ? open(("/proc/" + std::to_string(pid)).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC)
-                : -1) {}
+      : owned_(pid > 0 ? open(("/proc/" + std::to_string(pid)).c_str(),
+                              O_RDONLY | O_DIRECTORY | O_CLOEXEC)
+                       : -1),
+        fd_(owned_.get()) {}
+  // Reads through a directory held elsewhere (a pinned peer's), opened O_PATH or not.
+  static ProcDirectory borrowing(int directory) { return ProcDirectory(directory, Borrowed{}); }
 
-  bool valid() const { return fd_.valid(); }
+  bool valid() const { return fd_ >= 0; }
 
   std::optional<std::string> read(const char* name) const {
     // Plain reads: a process that ends while its file is read makes the read fail (ESRCH), which
     // must be an answer here, never an exception.
-    UniqueFd file(openat(fd_.get(), name, O_RDONLY | O_CLOEXEC));
+    UniqueFd file(openat(fd_, name, O_RDONLY | O_CLOEXEC));
     if (!file.valid()) return std::nullopt;
     std::string content;
     char buffer[4096];
@@ -64,7 +68,7 @@ class ProcDirectory {
 
   bool executable(std::uint64_t* device, std::uint64_t* inode) const {
     struct stat info {};
-    if (fstatat(fd_.get(), "exe", &info, 0) != 0) return false;
+    if (fstatat(fd_, "exe", &info, 0) != 0) return false;
     *device = info.st_dev;
     *inode = info.st_ino;
     return true;
@@ -81,14 +85,45 @@ class ProcDirectory {
 
   std::optional<std::string> executablePath() const {
     char buffer[4096];
-    ssize_t n = readlinkat(fd_.get(), "exe", buffer, sizeof buffer - 1);
+    ssize_t n = readlinkat(fd_, "exe", buffer, sizeof buffer - 1);
     if (n <= 0) return std::nullopt;
     return std::string(buffer, static_cast<std::size_t>(n));
   }
 
  private:
-  UniqueFd fd_;
+  struct Borrowed {};
+  ProcDirectory(int directory, Borrowed) : fd_(directory) {}
+
+  UniqueFd owned_;
+  int fd_ = -1;
 };
+
+AuditToken tokenFrom(const ProcDirectory& process, pid_t pid, uid_t uid, gid_t gid) {
+  if (!process.valid()) return AuditToken{};
+  std::optional<std::uint64_t> start = process.startTime();
+  AuditToken token;
+  if (!start) return token;
+  token.pid = pid;
+  token.uid = uid;
+  token.gid = gid;
+  token.startTime = *start;
+  if (!process.executable(&token.exeDevice, &token.exeInode)) return AuditToken{};
+  return token;
+}
+
+// The held directory of the token's process when a connection has it pinned.
+std::shared_ptr<const UniqueFd> pinnedDirectory(const AuditToken& token) {
+  return PinnedProcesses::shared().directoryOf(token);
+}
+
+// The path of the program the process runs, when it is the token's.
+std::optional<std::string> pathRun(const ProcDirectory& process, const AuditToken& token) {
+  if (!process.runs(token)) return std::nullopt;
+  std::optional<std::string> path = process.executablePath();
+  // An exec between the two looks would name the new program.
+  if (!path || !process.runs(token)) return std::nullopt;
+  return path;
+}
 
 }  // namespace
 
@@ -103,17 +138,15 @@ std::optional<std::string> ProcessIdentity::readProcessFile(pid_t pid, const cha
 }
 
 AuditToken ProcessIdentity::ofProcess(pid_t pid, uid_t uid, gid_t gid) {
-  ProcDirectory process(pid);
-  if (!process.valid()) return AuditToken{};
-  std::optional<std::uint64_t> start = process.startTime();
-  AuditToken token;
-  if (!start) return token;
-  token.pid = pid;
-  token.uid = uid;
-  token.gid = gid;
-  token.startTime = *start;
-  if (!process.executable(&token.exeDevice, &token.exeInode)) return AuditToken{};
-  return token;
+  return tokenFrom(ProcDirectory(pid), pid, uid, gid);
+}
+
+AuditToken ProcessIdentity::ofProcessDirectory(int directory, pid_t pid, uid_t uid, gid_t gid) {
+  return tokenFrom(ProcDirectory::borrowing(directory), pid, uid, gid);
+}
+
+std::optional<std::uint64_t> ProcessIdentity::startTimeIn(int directory) {
+  return ProcDirectory::borrowing(directory).startTime();
 }
 
 AuditToken ProcessIdentity::ofSocketPeer(int fd) {
@@ -127,18 +160,19 @@ AuditToken ProcessIdentity::ofSocketPeer(int fd) {
 
 bool ProcessIdentity::isValid(const AuditToken& token) {
   if (token.isZero()) return false;
+  if (auto pinned = pinnedDirectory(token))
+    return ProcDirectory::borrowing(pinned->get()).runs(token);
   ProcDirectory process(token.pid);
   return process.isOf(token) && process.runs(token);
 }
 
 std::optional<std::string> ProcessIdentity::executablePath(const AuditToken& token) {
   if (token.isZero()) return std::nullopt;
+  if (auto pinned = pinnedDirectory(token))
+    return pathRun(ProcDirectory::borrowing(pinned->get()), token);
   ProcDirectory process(token.pid);
-  if (!process.isOf(token) || !process.runs(token)) return std::nullopt;
-  std::optional<std::string> path = process.executablePath();
-  // An exec between the two looks would name the new program.
-  if (!path || !process.runs(token)) return std::nullopt;
-  return path;
+  if (!process.isOf(token)) return std::nullopt;
+  return pathRun(process, token);
 }
 
 }  // namespace typhora

@@ -6,6 +6,8 @@
 
 #include <sys/types.h>
 
+#include <memory>
+
 #include "platform/fd/unique_fd.h"
 #include "platform/ipc/audit_token.h"
 
@@ -36,7 +38,8 @@ class ProcessPin {
                         int* error = nullptr);
 
   AuditToken token_;
-  UniqueFd procDir_;
+  // Shared with `PinnedProcesses`, which finds it again by token while a pin holds it.
+  std::shared_ptr<const UniqueFd> procDir_;
   bool executableKnown_ = false;
 };
 
