@@ -4,7 +4,7 @@ set -euo pipefail
 
 packages=(
   g++ clang libclang-rt-14-dev cmake ninja-build pkg-config git
-  libcbor-dev libsodium-dev libsimdjson-dev libsystemd-dev libfreetype-dev
+  libcbor-dev libsodium-dev nettle-dev libsimdjson-dev libsystemd-dev libfreetype-dev
   libgtest-dev libgmock-dev libbenchmark-dev
   systemd procps fontconfig libfontconfig-dev dbus-daemon scdoc
   fonts-dejavu-core fonts-noto-core fonts-wqy-microhei fonts-inter-variable

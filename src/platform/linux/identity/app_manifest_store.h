@@ -9,6 +9,7 @@
 
 #include <sys/stat.h>
 
+#include <future>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -48,6 +49,7 @@ class AppManifestStore {
   static std::optional<ProgramKey> programKey(int fd);
   std::optional<std::string> digestOfFile(int fd, const ProgramKey& key) const;
   mutable std::map<ProgramKey, std::string> digests_;
+  mutable std::map<ProgramKey, std::shared_future<std::optional<std::string>>> hashing_;
 };
 
 }  // namespace typhora

@@ -9,8 +9,12 @@
 
 #include <algorithm>
 #include <array>
+#include <atomic>
 #include <filesystem>
 #include <fstream>
+#include <memory>
+#include <thread>
+#include <vector>
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -143,6 +147,23 @@ TEST_F(LinuxIdentityTest, NoRecordWithoutAnUnchangedProgramOfAManifest) {
   EXPECT_FALSE(signing_.codeSigningRecord(replaced.token()));
   replaced.stop();
   EXPECT_FALSE(signing_.codeSigningRecord(replaced.token()));
+}
+
+TEST_F(LinuxIdentityTest, ProcessesOfOneProgramAskingAtOnceAllGetItsManifest) {
+  // The first queries about a program hash it once while the others wait for that digest.
+  std::string path = install("fonts", "com.example.fonts");
+  std::vector<std::unique_ptr<Program>> apps;
+  for (int i = 0; i < 4; ++i) apps.push_back(std::make_unique<Program>(path));
+  std::vector<std::thread> askers;
+  std::atomic<int> signed_{0};
+  for (int i = 0; i < 16; ++i) {
+    askers.emplace_back([&, i] {
+      auto record = signing_.codeSigningRecord(apps[i % apps.size()]->token());
+      if (record && record->signingIdentifier() == "com.example.fonts") ++signed_;
+    });
+  }
+  for (auto& asker : askers) asker.join();
+  EXPECT_EQ(signed_.load(), 16);
 }
 
 TEST_F(LinuxIdentityTest, MalformedManifestsAreSkippedAndNewOnesSeen) {
