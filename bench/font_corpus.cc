@@ -1,6 +1,7 @@
 #include "font_corpus.h"
 
 #include <fcntl.h>
+#include <sys/file.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -9,6 +10,8 @@
 #include <cstdio>
 #include <filesystem>
 #include <fstream>
+
+#include "platform/fd/unique_fd.h"
 
 namespace typhora::bench {
 namespace {
@@ -49,6 +52,9 @@ int runWithConfig(const std::string& configFile, std::vector<const char*> argv) 
 FontCorpus::FontCorpus(int fonts)
     : dir_("/tmp/typhora-compare-fonts-" + std::to_string(fonts)),
       configFile_(dir_ + "/fonts.conf") {
+  // Benchmarks run side by side (several worktrees) lay the corpus out once, one at a time.
+  UniqueFd lock(open((dir_ + ".lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644));
+  if (lock.valid()) flock(lock.get(), LOCK_EX);
   if (!fs::exists(dir_ + "/complete") && !generate(fonts)) return;
   config_ = FcConfigCreate();
   if (!FcConfigParseAndLoad(config_, reinterpret_cast<const FcChar8*>(configFile_.c_str()),
@@ -77,6 +83,7 @@ bool FontCorpus::generate(int fonts) {
   if (sources.empty()) return false;
   std::error_code ec;
   fs::remove_all(dir_, ec);
+  fs::remove_all(cacheDir(), ec);
   std::fprintf(stderr, "compare: laying out %d font files in %s (once)\n", fonts, dir_.c_str());
   for (int i = 0; i < fonts; ++i) {
     const fs::path directory = fs::path(dir_) / ("d" + std::to_string(i / kFontsPerDirectory));
@@ -88,8 +95,8 @@ bool FontCorpus::generate(int fonts) {
   }
   std::ofstream(configFile_) << "<?xml version=\"1.0\"?>\n<!DOCTYPE fontconfig SYSTEM "
                                 "\"urn:fontconfig:fonts.dtd\">\n<fontconfig><dir>"
-                             << dir_ << "</dir><cachedir>" << dir_
-                             << "/cache</cachedir></fontconfig>\n";
+                             << dir_ << "</dir><cachedir>" << cacheDir()
+                             << "</cachedir></fontconfig>\n";
   std::fprintf(stderr, "compare: building the fontconfig cache (once)\n");
   if (runWithConfig(configFile_, {"fc-cache", "-f"}) != 0) return false;
   std::ofstream(dir_ + "/complete") << fonts << "\n";

@@ -28,6 +28,9 @@ class FontCorpus {
 
  private:
   bool generate(int fonts);
+  // fontconfig's cache lies beside the fonts: inside the scanned tree, a cache left by an earlier
+  // layout makes fc-cache see looped directories and fail.
+  std::string cacheDir() const { return dir_ + ".cache"; }
 
   std::string dir_;
   std::string configFile_;
