@@ -26,7 +26,9 @@ std::size_t maxRunningWork() {
   return most;
 }
 
-// Set on the leader while it runs a batch's handlers.
+// Set on the leader while it runs the handlers of a batch of one ready descriptor. With several,
+// the pool's workers are being woken for the others anyway, and a hand-off would add a wake-up
+// to each batch of a busy loop rather than save one.
 thread_local bool leadingBatch = false;
 thread_local LumoEventLoop::Work workAfterBatch;
 
@@ -140,7 +142,7 @@ LumoEventLoop::Work LumoEventLoop::leadOneBatch() {
     std::perror("lumo: epoll_wait");
     std::abort();
   }
-  leadingBatch = true;
+  leadingBatch = n == 1;
   for (int i = 0; i < n; ++i) {
     const int fd = static_cast<int>(events[i].data.u64 & 0xffffffffu);
     const auto generation = static_cast<std::uint32_t>(events[i].data.u64 >> 32);

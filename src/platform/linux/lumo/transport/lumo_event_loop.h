@@ -29,8 +29,9 @@ class LumoEventLoop {
   // After this returns, no new call of the fd's handler starts.
   void remove(int fd);
 
-  // From a handler: true when the calling thread leads and may still take work for after this
-  // batch (one piece a batch, while fewer than a few loop threads run such work).
+  // From a handler: true when the calling thread leads a batch of one ready descriptor and may
+  // still take work for after it (one piece a batch, while fewer than a few loop threads run
+  // such work).
   bool canRunAfterHandoff() const;
   // Only after canRunAfterHandoff() answered true in the same handler: runs `work` on this thread
   // once the batch is handled and the lead has passed to another thread.
