@@ -41,7 +41,7 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
     explicit Object(std::shared_ptr<Server> server) : server_(*server), keep_(std::move(server)) {}
     bool invoke(const IpcOperation& op, const std::vector<Value>& args, IpcReply reply) override {
       const AuditToken caller = IpcConnection::current()->auditToken();
-      server_.lastCaller = caller;
+      server_.setLastCaller(caller);
       const SerialQueue* queue = SerialQueue::current();
       if (queue == nullptr || queue->label() != "com.zorvane.lumo.connection") ++server_.offQueue;
       if (running_.exchange(true)) ++server_.overlaps;
@@ -88,6 +88,16 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
     return accepted_;
   }
 
+  // Handlers of different connections run at once, on threads the test does not join.
+  void setLastCaller(const AuditToken& caller) {
+    std::lock_guard lock(mutex_);
+    lastCaller_ = caller;
+  }
+  AuditToken lastCaller() {
+    std::lock_guard lock(mutex_);
+    return lastCaller_;
+  }
+
   void note(pid_t from, const std::string& text) {
     std::lock_guard lock(mutex_);
     notes_[from].push_back(text);
@@ -104,7 +114,6 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
   Semaphore invalidated;
   Semaphore hung;
   Semaphore noted;
-  AuditToken lastCaller;
   std::atomic<bool> blockHangs{false};  // hang:reply: holds its thread until released
   Semaphore release;
   std::atomic<int> offQueue{0};  // invocations that ran off their connection's queue
@@ -113,6 +122,7 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
  private:
   std::mutex mutex_;
   std::map<pid_t, std::vector<std::string>> notes_;
+  AuditToken lastCaller_;
   std::vector<std::shared_ptr<IpcConnection>> accepted_;
 };
 
@@ -169,8 +179,8 @@ TEST_F(LumoTest, ACallFromAnotherProcessIsAnsweredAndItsCallerIdentified) {
   EXPECT_EQ(child.wait(), 0);
   child.finishOutput();
   EXPECT_EQ(child.standardOutput(), "[{\"a\":[1,{\"$data\":\"AAE=\"}]}]\n");
-  EXPECT_EQ(server_->lastCaller.pid, child.pid());
-  EXPECT_EQ(server_->lastCaller.uid, getuid());
+  EXPECT_EQ(server_->lastCaller().pid, child.pid());
+  EXPECT_EQ(server_->lastCaller().uid, getuid());
 }
 
 TEST_F(LumoTest, AnEndpointTravelsFromAThroughBToCWhichThenConnectsToA) {
@@ -180,7 +190,7 @@ TEST_F(LumoTest, AnEndpointTravelsFromAThroughBToCWhichThenConnectsToA) {
   EXPECT_EQ(b.status, 0) << b.all;
   EXPECT_EQ(b.out, "from c\n");
   // The last call A served came from C, over the anonymous listener.
-  EXPECT_EQ(server_->lastCaller.pid, c.pid());
+  EXPECT_EQ(server_->lastCaller().pid, c.pid());
 }
 
 TEST_F(LumoTest, BadMessagesAreRefusedAndEveryoneElseIsStillServed) {
@@ -368,10 +378,10 @@ TEST_F(LumoTest, AThousandSimultaneousConnectionsAreServed) {
 
 TEST_F(LumoTest, ATokenStopsValidatingOnceItsProcessExecsAnotherProgram) {
   ChildProcess child(peer({"exec-after-call"}));
-  for (int i = 0; i < 500 && server_->lastCaller.pid != child.pid(); ++i) {
+  for (int i = 0; i < 500 && server_->lastCaller().pid != child.pid(); ++i) {
     std::this_thread::sleep_for(10ms);
   }
-  AuditToken token = server_->lastCaller;
+  AuditToken token = server_->lastCaller();
   ASSERT_EQ(token.pid, child.pid());
   for (int i = 0; i < 500 && ProcessIdentity::isValid(token); ++i)
     std::this_thread::sleep_for(10ms);
