@@ -3,7 +3,6 @@
 #include <sys/epoll.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cerrno>
 #include <chrono>
 #include <cstdio>
@@ -18,13 +17,12 @@ namespace {
 // A follower that has not been given the lead for this long leaves.
 constexpr auto kFollowerIdleExit = std::chrono::seconds(5);
 
-// Loop threads that may run handlers' work at once. Past them, work goes to the worker pool as
-// any queued job does, under the pool's own growth rules: a crowd of blocking handlers cannot
-// grow the loop's threads without bound.
-std::size_t maxRunningWork() {
-  static const std::size_t most = std::max(2u, std::thread::hardware_concurrency());
-  return most;
-}
+// Loop threads that may run handlers' work at once. Past it, work goes to the worker pool as any
+// queued job does, under the pool's own growth rules: blocking handlers cannot grow the loop's
+// threads. One is enough for the path it shortens (a lone call, its caller waiting); while it is
+// taken the loop is busy, and the pool's workers, awake across many jobs, cost fewer wake-ups
+// than a hand-off per call.
+constexpr std::size_t kMaxRunningWork = 1;
 
 // Set on the leader while it runs the handlers of a batch of one ready descriptor. With several,
 // the pool's workers are being woken for the others anyway, and a hand-off would add a wake-up
@@ -78,7 +76,7 @@ bool LumoEventLoop::canRunAfterHandoff() const {
   if (!leadingBatch || workAfterBatch) return false;
   // Only the leader adds to runningWork_, so a true answer holds until runAfterHandoff().
   std::lock_guard lock(leadMutex_);
-  return runningWork_ < maxRunningWork();
+  return runningWork_ < kMaxRunningWork;
 }
 
 void LumoEventLoop::runAfterHandoff(Work work) {

@@ -30,8 +30,7 @@ class LumoEventLoop {
   void remove(int fd);
 
   // From a handler: true when the calling thread leads a batch of one ready descriptor and may
-  // still take work for after it (one piece a batch, while fewer than a few loop threads run
-  // such work).
+  // still take work for after it (one piece a batch, while no other loop thread runs such work).
   bool canRunAfterHandoff() const;
   // Only after canRunAfterHandoff() answered true in the same handler: runs `work` on this thread
   // once the batch is handled and the lead has passed to another thread.
