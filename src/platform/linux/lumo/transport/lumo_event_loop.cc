@@ -83,13 +83,7 @@ void LumoEventLoop::runAfterHandoff(Work work) {
   workAfterBatch = std::move(work);
 }
 
-std::size_t LumoEventLoop::threadCount() {
-  std::lock_guard lock(leadMutex_);
-  return threads_;
-}
-
 void LumoEventLoop::startThreadLocked() {
-  ++threads_;
   std::thread([this] { threadMain(); }).detach();  // the loop lives as long as the process
 }
 
@@ -110,10 +104,7 @@ void LumoEventLoop::threadMain() {
     ++followers_;
     const bool lead = leadFree_.wait_for(lock, kFollowerIdleExit, [this] { return !led_; });
     --followers_;
-    if (!lead) {
-      --threads_;  // another thread leads
-      return;
-    }
+    if (!lead) return;  // another thread leads
     led_ = true;
     for (;;) {
       lock.unlock();

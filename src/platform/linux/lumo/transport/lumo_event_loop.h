@@ -36,8 +36,6 @@ class LumoEventLoop {
   // once the batch is handled and the lead has passed to another thread.
   void runAfterHandoff(Work work);
 
-  std::size_t threadCount();  // loop threads alive now (leader, followers, those running work)
-
  private:
   LumoEventLoop();
   void threadMain();
@@ -60,7 +58,6 @@ class LumoEventLoop {
   bool led_ = false;             // a thread leads (waits in epoll_wait or runs a batch)
   std::size_t followers_ = 0;    // threads waiting for the lead
   std::size_t runningWork_ = 0;  // threads running work left by a handler
-  std::size_t threads_ = 0;
 };
 
 }  // namespace typhora
