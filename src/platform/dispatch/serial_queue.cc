@@ -1,8 +1,9 @@
 // Serial queues on a shared worker pool. A queue is "scheduled" while it sits in the pool's
-// ready list or a worker (or an inline sync caller) drains it; only then may its jobs run, so
-// they run one at a time. A worker that blocks inside a job keeps its thread: the pool starts
-// another for other queues, up to its cap (past a few eager workers, only once the ready queues
-// have waited a moment with no worker coming free), and idle workers leave after a while.
+// ready list or a worker (or an inline sync caller, or the thread that claimed it) drains it; only
+// then may its jobs run, so they run one at a time. A worker that blocks inside a job keeps its
+// thread: the pool starts another for other queues, up to its cap (past a few eager workers, only
+// once the ready queues have waited a moment with no worker coming free), and idle workers leave
+// after a while.
 //
 // A queue that a sync() caller waits on never depends on a free worker: it goes to the front of
 // the line and, when no worker is idle, gets a new one even past the cap. Without that, callers
@@ -56,6 +57,10 @@ bool isRunning(const SerialQueue::State* state) {
   return std::find(runningStack.begin(), runningStack.end(), state) != runningStack.end();
 }
 
+constexpr int kJobsPerTurn = 32;  // then the queue goes to the back of the pool's line
+
+void drainTurn(const std::shared_ptr<SerialQueue::State>& state);
+
 class WorkerPool {
  public:
   static WorkerPool& shared() {
@@ -99,7 +104,6 @@ class WorkerPool {
 
  private:
   static constexpr auto kIdleExit = std::chrono::seconds(5);
-  static constexpr int kJobsPerTurn = 32;  // then the queue goes to the back of the line
   // Past the eager workers, a queue that finds no idle worker gets a new one only when the ready
   // list has not moved for this long: a burst of short jobs (a font change reaching hundreds of
   // connections) is served by the workers there are, not by a thread per queue, while queues
@@ -168,32 +172,9 @@ class WorkerPool {
       ready_.pop_front();
       ++taken_;
       lock.unlock();
-      drain(state);
+      drainTurn(state);
       lock.lock();
     }
-  }
-
-  void drain(const StatePtr& state) {
-    bool waitedOn = false;
-    for (int n = 0;; ++n) {
-      SerialQueue::Job job;
-      {
-        std::lock_guard lock(state->mutex);
-        if (state->jobs.empty()) {
-          state->scheduled = false;
-          return;
-        }
-        if (n == kJobsPerTurn) {
-          waitedOn = state->waiters > 0;
-          break;
-        }
-        job = std::move(state->jobs.front());
-        state->jobs.pop_front();
-      }
-      RunningScope scope(state.get());
-      job();
-    }
-    submit(state, waitedOn);  // still scheduled: give other queues a turn first
   }
 
   std::mutex mutex_;
@@ -206,6 +187,31 @@ class WorkerPool {
   std::uint64_t taken_ = 0;  // queues taken from the ready list so far
   bool growerStarted_ = false;
 };
+
+// Runs up to a turn's worth of a scheduled queue's jobs on the calling thread; what is left goes
+// to the back of the pool's line, still scheduled, so other queues get a turn first.
+void drainTurn(const StatePtr& state) {
+  bool waitedOn = false;
+  for (int n = 0;; ++n) {
+    SerialQueue::Job job;
+    {
+      std::lock_guard lock(state->mutex);
+      if (state->jobs.empty()) {
+        state->scheduled = false;
+        return;
+      }
+      if (n == kJobsPerTurn) {
+        waitedOn = state->waiters > 0;
+        break;
+      }
+      job = std::move(state->jobs.front());
+      state->jobs.pop_front();
+    }
+    RunningScope scope(state.get());
+    job();
+  }
+  WorkerPool::shared().submit(state, waitedOn);
+}
 
 // Queues `job`; `waiter` counts the caller among the queue's sync() waiters first.
 void enqueue(const StatePtr& state, SerialQueue::Job job, bool waiter = false) {
@@ -280,6 +286,22 @@ std::size_t SerialQueue::pendingJobs() const {
 
 void SerialQueue::async(Job job) {
   enqueue(state_, std::move(job));
+}
+
+bool SerialQueue::asyncClaiming(Job job) {
+  if (state_->manual) {
+    enqueue(state_, std::move(job));
+    return false;
+  }
+  std::lock_guard lock(state_->mutex);
+  state_->jobs.push_back(std::move(job));
+  if (state_->scheduled) return false;
+  state_->scheduled = true;
+  return true;
+}
+
+void SerialQueue::drainClaimed() {
+  drainTurn(state_);
 }
 
 void SerialQueue::sync(const Job& job) {

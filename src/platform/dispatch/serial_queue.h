@@ -36,6 +36,13 @@ class SerialQueue : public std::enable_shared_from_this<SerialQueue> {
   std::size_t pendingJobs() const;
 
   void async(Job job);
+  // Queues `job` like async(), but when the queue is idle it is claimed for the caller instead of
+  // going to the pool, and the answer is true: the caller must then call drainClaimed(), on the
+  // thread of its choice, without waiting on anything first. Jobs queued meanwhile wait for it.
+  bool asyncClaiming(Job job);
+  // Runs a claimed queue's jobs on the calling thread, up to a turn's worth, then gives what is
+  // left to the pool.
+  void drainClaimed();
   // Runs `job` on this queue and waits for it. From a job already running on this queue (also
   // through a chain of sync calls) it aborts the process with a message naming the queue.
   void sync(const Job& job);

@@ -3,7 +3,9 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <string>
 #include <thread>
+#include <vector>
 
 #include "platform/dispatch/manual_clock.h"
 #include "platform/dispatch/one_shot_timer.h"
@@ -120,6 +122,37 @@ TEST(SerialQueue, SyncRunsInlineOrWaitsAndKnowsItsQueue) {
   });
   a->sync([&] { EXPECT_TRUE(firstDone); });
   releaser.join();
+}
+
+// A queue claimed by a thread waits for that thread: the pool leaves it alone, jobs queued
+// meanwhile (a sync caller's too) run after the claiming job, on the claimer, as the queue's.
+TEST(SerialQueue, AClaimedQueueRunsOnItsClaimerInOrder) {
+  auto queue = SerialQueue::create("test.claimed");
+  std::vector<std::string> seen;
+  std::atomic<int> offClaimer{0};
+  const auto here = std::this_thread::get_id();
+  auto job = [&](std::string name) {
+    return [&, name] {
+      if (!queue->isCurrent()) seen.push_back("not current");
+      if (name != "sync" && std::this_thread::get_id() != here) ++offClaimer;
+      seen.push_back(name);
+    };
+  };
+  ASSERT_TRUE(queue->asyncClaiming(job("a")));
+  EXPECT_FALSE(queue->asyncClaiming(job("b")));
+  queue->async(job("c"));
+  std::thread caller([&] { queue->sync(job("sync")); });
+  for (int i = 0; i < 500 && queue->pendingJobs() < 4; ++i) std::this_thread::sleep_for(10ms);
+  std::this_thread::sleep_for(50ms);
+  EXPECT_EQ(queue->pendingJobs(), 4u) << "nothing of a claimed queue runs before its claimer";
+  queue->drainClaimed();
+  caller.join();
+  EXPECT_EQ(seen, (std::vector<std::string>{"a", "b", "c", "sync"}));
+  EXPECT_EQ(offClaimer.load(), 0);
+  // Once drained, the queue is the pool's again.
+  queue->async(job("d"));
+  queue->sync([] {});
+  EXPECT_EQ(seen.back(), "d");
 }
 
 TEST(SerialQueueDeathTest, SyncOntoTheRunningQueueAbortsNamingIt) {

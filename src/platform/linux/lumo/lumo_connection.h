@@ -1,14 +1,15 @@
 // A lumo connection over a Unix stream socket.
 //
-// Reading (on the process's one I/O thread): a budget of bytes per connection per turn, so one
+// Reading (on the I/O loop's leading thread): a budget of bytes per connection per turn, so one
 // busy peer cannot hold the thread; the stream is only cut into raw frames there. Every read
 // carries the kernel's credentials of the process that wrote it (SO_PASSCRED), and a frame
 // counts only when its writer is the pinned peer process. An invocation is decoded and handled
 // on the connection's own serial queue, with the connection current, after a check that the
-// peer still runs the program it was pinned with. A connection whose undispatched invocations
-// pile up is not read until its queue catches up: the kernel holds the rest, and the peer's
-// writes block. Replies to synchronous calls go to the waiting thread, which decodes them, so a
-// synchronous call made from the connection's own queue cannot deadlock and never needs a free
+// peer still runs the program it was pinned with; when that queue is idle, the thread that read
+// the frame runs it once it has passed the loop's lead on. A connection whose undispatched
+// invocations pile up is not read until its queue catches up: the kernel holds the rest, and the
+// peer's writes block. Replies to synchronous calls go to the waiting thread, which decodes them,
+// so a synchronous call made from the connection's own queue cannot deadlock and never needs a free
 // worker. While one synchronous call waits, its thread reads the socket itself (with the same
 // checks) and the I/O thread leaves that socket alone.
 //
@@ -113,6 +114,7 @@ class LumoConnection final : public IpcConnection {
   bool takeFrame(LumoRawFrame frame, std::string* error);
   bool takeHello(LumoRawFrame frame, std::string* error);
   void routeReply(LumoRawFrame frame);
+  void toQueue(SerialQueue::Job job);
   void updateInboundLocked();
   void updateInterestLocked();
   // The connection's queue.

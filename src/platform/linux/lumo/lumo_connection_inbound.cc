@@ -225,9 +225,29 @@ bool LumoConnection::takeFrame(LumoRawFrame frame, std::string* error) {
   }
   auto self = std::static_pointer_cast<LumoConnection>(shared_from_this());
   // Jobs are copyable; the frame's descriptors are not.
+  const bool answerAwaited = frame.id != 0;
   auto held = std::make_shared<LumoRawFrame>(std::move(frame));
-  queue_->async([self, held] { self->handleInvoke(std::move(*held)); });
+  SerialQueue::Job job = [self, held] { self->handleInvoke(std::move(*held)); };
+  // A call's answer is awaited, so the hand-off saved is on the caller's path. A one-way message
+  // has nobody waiting, and under a burst of them (a font change fanned out) a hand-off per
+  // frame costs more wake-ups than the pool, whose workers stay awake across the burst.
+  if (answerAwaited) {
+    toQueue(std::move(job));
+  } else {
+    queue_->async(std::move(job));
+  }
   return true;
+}
+
+void LumoConnection::toQueue(SerialQueue::Job job) {
+  // On the loop's leader, an idle queue is run by this very thread once it has passed the lead
+  // on: the frame waits for no worker's wake-up. Elsewhere (a synchronous caller reading for
+  // itself, a busy queue, every loop thread already running work) it goes the usual way.
+  LumoEventLoop& loop = LumoEventLoop::shared();
+  if (!loop.canRunAfterHandoff()) return queue_->async(std::move(job));
+  if (queue_->asyncClaiming(std::move(job))) {
+    loop.runAfterHandoff([queue = queue_] { queue->drainClaimed(); });
+  }
 }
 
 bool LumoConnection::takeHello(LumoRawFrame frame, std::string* error) {
@@ -283,7 +303,7 @@ void LumoConnection::routeReply(LumoRawFrame frame) {
   if (pending->synchronous) return finish(pending, std::move(frame), "");
   auto self = std::static_pointer_cast<LumoConnection>(shared_from_this());
   auto held = std::make_shared<LumoRawFrame>(std::move(frame));
-  queue_->async([self, pending, held] {
+  toQueue([self, pending, held] {
     std::string error;
     std::optional<LumoMessage> message = self->decode(std::move(*held), &error);
     CurrentScope scope(self);

@@ -8,6 +8,8 @@
 //   flood DIR [BYTES]      sends calls of BYTES (1 MiB) on a raw socket, never reading answers
 //   garbage DIR            sends bytes that are no frame, then a valid call
 //   notes DIR N            N times: connects, sends the one-way note: and closes at once
+//   ordered DIR N          on one connection, sends the notes "0" to "N-1", then one echo:reply:
+//                          (answered only once the notes are handled)
 //   callers DIR T N        on one connection, T threads each make N synchronous count:reply:
 //                          calls while one more thread makes asynchronous ones; prints the
 //                          number of wrong or missing answers
@@ -128,6 +130,18 @@ int main(int argc, char** argv) {
       connection->invalidate();
     }
     return 0;
+  }
+  if (mode == "ordered" && argc == 4) {
+    auto connection = service.connectToService("test.a");
+    connection->setRemoteInterface(lumoTestInterface());
+    connection->resume();
+    for (int i = 0, n = std::stoi(argv[3]); i < n; ++i) {
+      connection->remoteObjectProxy({})->call("note:", {Value(std::to_string(i))});
+    }
+    std::vector<Value> reply;
+    connection->synchronousRemoteObjectProxy({})->call(
+        "echo:reply:", {Value("done")}, [&](std::vector<Value> values) { reply = values; });
+    return reply.size() == 1 ? 0 : 1;
   }
   if (mode == "callers" && argc == 5) {
     const int threads = std::stoi(argv[3]);

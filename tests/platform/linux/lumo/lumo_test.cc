@@ -7,11 +7,13 @@
 
 #include <atomic>
 #include <filesystem>
+#include <map>
 #include <mutex>
 #include <thread>
 
 #include "integration/child_process.h"
 #include "platform/dispatch/semaphore.h"
+#include "platform/dispatch/serial_queue.h"
 #include "platform/linux/identity/process_identity.h"
 #include "platform/linux/lumo/lumo_admission.h"
 #include "platform/linux/lumo/lumo_service.h"
@@ -38,18 +40,30 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
    public:
     explicit Object(std::shared_ptr<Server> server) : server_(*server), keep_(std::move(server)) {}
     bool invoke(const IpcOperation& op, const std::vector<Value>& args, IpcReply reply) override {
-      server_.lastCaller = IpcConnection::current()->auditToken();
+      const AuditToken caller = IpcConnection::current()->auditToken();
+      server_.setLastCaller(caller);
+      const SerialQueue* queue = SerialQueue::current();
+      if (queue == nullptr || queue->label() != "com.zorvane.lumo.connection") ++server_.offQueue;
+      if (running_.exchange(true)) ++server_.overlaps;
       if (op.wireName == "echo:reply:") reply({args[0]});
       if (op.wireName == "count:reply:") reply({Value(*args[0].asInt() + 1)});
-      if (op.wireName == "hang:reply:") server_.hung.signal();  // never answered
-      if (op.wireName == "note:") server_.noted.signal();
+      if (op.wireName == "hang:reply:") {
+        server_.hung.signal();  // never answered
+        if (server_.blockHangs) server_.release.waitFor(30s);
+      }
+      if (op.wireName == "note:") {
+        server_.note(caller.pid, *args[0].asString());
+        server_.noted.signal();
+      }
       if (op.wireName == "endpoint:reply:") reply({Value(server_.anonymous->endpoint())});
+      running_ = false;
       return op.wireName != "useEndpoint:reply:";
     }
 
    private:
     Server& server_;
-    std::shared_ptr<Server> keep_;  // handlers may outlive the test that made the server
+    std::atomic<bool> running_{false};  // one object per connection
+    std::shared_ptr<Server> keep_;      // handlers may outlive the test that made the server
   };
 
   bool shouldAcceptNewConnection(IpcListener&, std::shared_ptr<IpcConnection> c) override {
@@ -74,6 +88,25 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
     return accepted_;
   }
 
+  // Handlers of different connections run at once, on threads the test does not join.
+  void setLastCaller(const AuditToken& caller) {
+    std::lock_guard lock(mutex_);
+    lastCaller_ = caller;
+  }
+  AuditToken lastCaller() {
+    std::lock_guard lock(mutex_);
+    return lastCaller_;
+  }
+
+  void note(pid_t from, const std::string& text) {
+    std::lock_guard lock(mutex_);
+    notes_[from].push_back(text);
+  }
+  std::vector<std::string> notesFrom(pid_t from) {
+    std::lock_guard lock(mutex_);
+    return notes_[from];
+  }
+
   LumoService& service_;
   std::shared_ptr<IpcListener> anonymous;
   std::atomic<int> accepted{0};
@@ -81,10 +114,15 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
   Semaphore invalidated;
   Semaphore hung;
   Semaphore noted;
-  AuditToken lastCaller;
+  std::atomic<bool> blockHangs{false};  // hang:reply: holds its thread until released
+  Semaphore release;
+  std::atomic<int> offQueue{0};  // invocations that ran off their connection's queue
+  std::atomic<int> overlaps{0};  // invocations begun while one of the same connection ran
 
  private:
   std::mutex mutex_;
+  std::map<pid_t, std::vector<std::string>> notes_;
+  AuditToken lastCaller_;
   std::vector<std::shared_ptr<IpcConnection>> accepted_;
 };
 
@@ -113,6 +151,19 @@ class LumoTest : public ::testing::Test {
     argv.insert(argv.end(), args.begin() + 1, args.end());
     return argv;
   }
+  // Runs `n` callers at once, each its own process; answers how many got the right answer.
+  int answeredOfCallers(int n) {
+    std::vector<std::thread> clients;
+    std::atomic<int> answered{0};
+    for (int i = 0; i < n; ++i) {
+      clients.emplace_back([&, i] {
+        auto r = runCommand(peer({"call", "count:reply:", std::to_string(i)}), 30s);
+        answered += r.status == 0 && r.out == "[" + std::to_string(i + 1) + "]\n";
+      });
+    }
+    for (auto& t : clients) t.join();
+    return answered.load();
+  }
   void waitForInvalidations(int n) {
     for (int i = 0; i < 500 && server_->invalidations < n; ++i) std::this_thread::sleep_for(10ms);
   }
@@ -128,8 +179,8 @@ TEST_F(LumoTest, ACallFromAnotherProcessIsAnsweredAndItsCallerIdentified) {
   EXPECT_EQ(child.wait(), 0);
   child.finishOutput();
   EXPECT_EQ(child.standardOutput(), "[{\"a\":[1,{\"$data\":\"AAE=\"}]}]\n");
-  EXPECT_EQ(server_->lastCaller.pid, child.pid());
-  EXPECT_EQ(server_->lastCaller.uid, getuid());
+  EXPECT_EQ(server_->lastCaller().pid, child.pid());
+  EXPECT_EQ(server_->lastCaller().uid, getuid());
 }
 
 TEST_F(LumoTest, AnEndpointTravelsFromAThroughBToCWhichThenConnectsToA) {
@@ -139,7 +190,7 @@ TEST_F(LumoTest, AnEndpointTravelsFromAThroughBToCWhichThenConnectsToA) {
   EXPECT_EQ(b.status, 0) << b.all;
   EXPECT_EQ(b.out, "from c\n");
   // The last call A served came from C, over the anonymous listener.
-  EXPECT_EQ(server_->lastCaller.pid, c.pid());
+  EXPECT_EQ(server_->lastCaller().pid, c.pid());
 }
 
 TEST_F(LumoTest, BadMessagesAreRefusedAndEveryoneElseIsStillServed) {
@@ -200,19 +251,52 @@ TEST_F(LumoTest, APeerKilledInTheMiddleOfACallRunsTheInvalidationHandlerOnce) {
   EXPECT_EQ(server_->invalidations.load(), 1);
 }
 
+// The thread that reads a frame may run the handler itself: a connection's invocations still run
+// one at a time, in the order sent, on the connection's queue, with several peers at once.
+TEST_F(LumoTest, EachConnectionsInvocationsRunInOrderOnItsQueue) {
+  constexpr int kNotes = 300;
+  std::vector<std::unique_ptr<ChildProcess>> peers;
+  for (int i = 0; i < 3; ++i) {
+    peers.push_back(std::make_unique<ChildProcess>(peer({"ordered", std::to_string(kNotes)})));
+  }
+  for (auto& p : peers) {
+    ASSERT_EQ(p->waitFor(60s), 0) << p->output();
+    std::vector<std::string> notes = server_->notesFrom(p->pid());
+    ASSERT_EQ(notes.size(), static_cast<std::size_t>(kNotes));
+    for (int i = 0; i < kNotes; ++i) ASSERT_EQ(notes[i], std::to_string(i));
+  }
+  EXPECT_EQ(server_->offQueue.load(), 0);
+  EXPECT_EQ(server_->overlaps.load(), 0);
+}
+
+// Handlers that block (more of them than the loop keeps threads for running handlers) hold no
+// other connection up: new peers are accepted, read and answered meanwhile. A peer killed while
+// its handler blocks is ended only after that handler has returned.
+TEST_F(LumoTest, BlockedHandlersLeaveOtherClientsServedAndAPeerGoneMidHandlerEndsAfterIt) {
+  constexpr int kBlocked = 5;
+  server_->blockHangs = true;
+  std::vector<std::unique_ptr<ChildProcess>> hanging;
+  for (int i = 0; i < kBlocked; ++i) {
+    hanging.push_back(std::make_unique<ChildProcess>(peer({"hang"})));
+    ASSERT_TRUE(server_->hung.waitFor(20s)) << i;
+  }
+  EXPECT_EQ(answeredOfCallers(6), 6);
+  waitForInvalidations(6);  // the callers' ends
+  for (int i = 0; i < 6; ++i) ASSERT_TRUE(server_->invalidated.waitFor(1s));
+
+  hanging[0]->kill(SIGKILL);
+  hanging[0]->wait();
+  EXPECT_FALSE(server_->invalidated.waitFor(300ms)) << "ended while its handler still ran";
+  for (int i = 0; i < kBlocked; ++i) server_->release.signal();
+  EXPECT_TRUE(server_->invalidated.waitFor(20s));
+  EXPECT_EQ(server_->invalidations.load(), 7);
+  EXPECT_EQ(server_->overlaps.load(), 0);
+}
+
 TEST_F(LumoTest, APeerThatStopsReadingIsCutOffWhileOthersAreAnswered) {
   testing::LogCapture log;
   ChildProcess flood(peer({"flood"}));
-  std::vector<std::thread> clients;
-  std::atomic<int> answered{0};
-  for (int i = 0; i < 10; ++i) {
-    clients.emplace_back([&, i] {
-      auto r = runCommand(peer({"call", "count:reply:", std::to_string(i)}), 30s);
-      answered += r.status == 0 && r.out == "[" + std::to_string(i + 1) + "]\n";
-    });
-  }
-  for (auto& t : clients) t.join();
-  EXPECT_EQ(answered.load(), 10);
+  EXPECT_EQ(answeredOfCallers(10), 10);
   for (int i = 0; i < 1000 && !log.contains("cut off"); ++i) std::this_thread::sleep_for(10ms);
   EXPECT_TRUE(log.contains("the peer stopped reading; cut off")) << flood.output();
 }
@@ -294,10 +378,10 @@ TEST_F(LumoTest, AThousandSimultaneousConnectionsAreServed) {
 
 TEST_F(LumoTest, ATokenStopsValidatingOnceItsProcessExecsAnotherProgram) {
   ChildProcess child(peer({"exec-after-call"}));
-  for (int i = 0; i < 500 && server_->lastCaller.pid != child.pid(); ++i) {
+  for (int i = 0; i < 500 && server_->lastCaller().pid != child.pid(); ++i) {
     std::this_thread::sleep_for(10ms);
   }
-  AuditToken token = server_->lastCaller;
+  AuditToken token = server_->lastCaller();
   ASSERT_EQ(token.pid, child.pid());
   for (int i = 0; i < 500 && ProcessIdentity::isValid(token); ++i)
     std::this_thread::sleep_for(10ms);
