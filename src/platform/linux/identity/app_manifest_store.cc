@@ -118,7 +118,8 @@ std::optional<std::string> AppManifestStore::digestOfProgram(const AuditToken& t
 std::optional<std::string> AppManifestStore::digestOfFile(int fd, const ProgramKey& key) const {
   // One thread hashes a file; the others asking for it meanwhile (the first check-ins of many
   // processes of one program) wait for that thread, which is running, not queued.
-  std::promise<std::optional<std::string>> result;
+  // The promise (an allocation) is made only by the thread that hashes, not on every lookup.
+  std::optional<std::promise<std::optional<std::string>>> result;
   std::shared_future<std::optional<std::string>> hashedElsewhere;
   {
     std::lock_guard lock(mutex_);
@@ -126,10 +127,10 @@ std::optional<std::string> AppManifestStore::digestOfFile(int fd, const ProgramK
     if (auto it = hashing_.find(key); it != hashing_.end()) {
       hashedElsewhere = it->second;
     } else {
-      hashing_.emplace(key, result.get_future().share());
+      hashing_.emplace(key, result.emplace().get_future().share());
     }
   }
-  if (hashedElsewhere.valid()) return hashedElsewhere.get();
+  if (!result) return hashedElsewhere.get();
   std::optional<std::string> digest = sha256Hex(fd);
   // A file changed while it was hashed gives a digest of neither version: not kept.
   if (digest && programKey(fd) != key) digest.reset();
@@ -141,7 +142,7 @@ std::optional<std::string> AppManifestStore::digestOfFile(int fd, const ProgramK
       digests_[key] = *digest;
     }
   }
-  result.set_value(digest);
+  result->set_value(digest);
   return digest;
 }
 
