@@ -35,14 +35,16 @@ namespace {
 using Clock = std::chrono::steady_clock;
 
 constexpr const char* kUsage =
-    "usage: compare [--rounds N] [--only WORKLOAD]\n"
+    "usage: compare [--rounds N] [--only WORKLOAD] [--without-bus]\n"
     "\n"
     "Runs each workload against its peer in this process run, N rounds (default 5), and prints\n"
-    "medians, spreads and ratios. WORKLOAD: empty-call, checkin, names, fanout, cold-start.\n";
+    "medians, spreads and ratios. WORKLOAD: empty-call, checkin, names, fanout, cold-start.\n"
+    "--without-bus leaves the D-Bus peer out (its rows stay 0), as when profiling the daemon.\n";
 
 struct Options {
   int rounds = 5;
   std::string only;
+  bool withBus = true;
 };
 
 double secondsSince(Clock::time_point start) {
@@ -82,7 +84,7 @@ class Comparison {
 
   Options options_;
   ComparisonTable table_;
-  PrivateBus bus_;
+  std::unique_ptr<PrivateBus> bus_;
   std::unique_ptr<BusServer> busServer_;
   sd_bus* busClient_ = nullptr;
   std::map<int, std::unique_ptr<BenchDevice>> devices_;
@@ -291,9 +293,10 @@ void Comparison::coldStart() {
 
 int Comparison::run() {
   setLogLevel(LogLevel::Error);
-  if (bus_.ready()) {
-    busServer_ = std::make_unique<BusServer>(bus_);
-    busClient_ = busServer_->ready() ? bus_.connect() : nullptr;
+  if (options_.withBus) bus_ = std::make_unique<PrivateBus>();
+  if (bus_ && bus_->ready()) {
+    busServer_ = std::make_unique<BusServer>(*bus_);
+    busClient_ = busServer_->ready() ? bus_->connect() : nullptr;
   }
   if (busClient_ == nullptr) std::fprintf(stderr, "compare: no private D-Bus; its rows stay 0\n");
   const std::string before = loadAverage();
@@ -354,6 +357,8 @@ int main(int argc, char** argv) {
     const std::string arg = argv[i];
     if (arg == "--rounds" && i + 1 < argc) {
       options.rounds = std::max(1, std::atoi(argv[++i]));
+    } else if (arg == "--without-bus") {
+      options.withBus = false;
     } else if (arg == "--only" && i + 1 < argc) {
       options.only = argv[++i];
     } else {

@@ -44,13 +44,16 @@ std::shared_ptr<const Bytes> keptEncoding(const void* container, std::size_t ite
 
 // An upper bound of the encoded size (9 bytes covers any head), so that the output buffer is
 // allocated once: growing a multi-megabyte buffer step by step costs more than encoding it.
-std::size_t sizeBound(const Value& value, std::size_t depth) {
+std::size_t sizeBound(const Value& value, std::size_t depth, bool splicing) {
   if (depth > 256) return 0;  // the encoder refuses such depths anyway
   if (const LazyContainer* lazy = value.lazyContainer()) return lazy->encoding().size();
+  auto keptSize = [splicing](const std::shared_ptr<const Bytes>& kept) {
+    return splicing && kept->size() >= CborCodec::kSpliceBytes ? 0 : kept->size();
+  };
   if (const Dictionary* dictionary = value.asDictionary()) {
-    if (auto kept = keptEncoding(dictionary, dictionary->size())) return kept->size();
+    if (auto kept = keptEncoding(dictionary, dictionary->size())) return keptSize(kept);
   } else if (const ValueArray* array = value.asArray()) {
-    if (auto kept = keptEncoding(array, array->size())) return kept->size();
+    if (auto kept = keptEncoding(array, array->size())) return keptSize(kept);
   }
   switch (value.type()) {
     case Value::Type::String:
@@ -61,13 +64,13 @@ std::size_t sizeBound(const Value& value, std::size_t depth) {
       return 18;
     case Value::Type::Array: {
       std::size_t n = 9;
-      for (const Value& item : *value.asArray()) n += sizeBound(item, depth + 1);
+      for (const Value& item : *value.asArray()) n += sizeBound(item, depth + 1, splicing);
       return n;
     }
     case Value::Type::Dictionary: {
       std::size_t n = 9;
       for (const auto& [key, item] : *value.asDictionary()) {
-        n += 9 + key.size() + sizeBound(item, depth + 1);
+        n += 9 + key.size() + sizeBound(item, depth + 1, splicing);
       }
       return n;
     }
@@ -78,8 +81,9 @@ std::size_t sizeBound(const Value& value, std::size_t depth) {
 
 class Encoder {
  public:
-  Encoder(Bytes* out, const EndpointHooks* hooks, std::string* error, std::size_t maxDepth)
-      : out_(*out), hooks_(hooks), error_(error), maxDepth_(maxDepth) {}
+  Encoder(Bytes* out, const EndpointHooks* hooks, std::string* error, std::size_t maxDepth,
+          std::vector<CborSplice>* splices)
+      : out_(*out), hooks_(hooks), error_(error), maxDepth_(maxDepth), splices_(splices) {}
 
   bool encode(const Value& value, std::size_t depth) {
     if (depth > maxDepth_) return fail("nesting deeper than the limit");
@@ -152,6 +156,10 @@ class Encoder {
     if (auto bytes = keptEncoding(container, items, &known, &kept)) {
       if (depth + known.height > maxDepth_) return fail("nesting deeper than the limit");
       deepest_ = std::max(deepest_, depth + known.height);
+      if (splices_ != nullptr && bytes->size() >= CborCodec::kSpliceBytes) {
+        splices_->push_back({out_.size(), std::move(bytes)});
+        return true;
+      }
       ensure(bytes->size());
       out_.insert(out_.end(), bytes->begin(), bytes->end());
       return true;
@@ -248,6 +256,7 @@ class Encoder {
   const EndpointHooks* hooks_;
   std::string* error_;
   std::size_t maxDepth_;
+  std::vector<CborSplice>* splices_;
   std::size_t deepest_ = 0;    // the deepest level encoded so far
   std::size_t endpoints_ = 0;  // endpoints met so far
 };
@@ -255,12 +264,14 @@ class Encoder {
 }  // namespace
 
 bool CborCodec::encode(const Value& value, Bytes* out, const EndpointHooks* hooks,
-                       std::string* error, std::size_t maxDepth) {
+                       std::string* error, std::size_t maxDepth, std::vector<CborSplice>* splices) {
   const std::size_t start = out->size();
-  out->reserve(start + sizeBound(value, 0));
-  Encoder encoder(out, hooks, error, maxDepth);
+  const std::size_t splicesBefore = splices != nullptr ? splices->size() : 0;
+  out->reserve(start + sizeBound(value, 0, splices != nullptr));
+  Encoder encoder(out, hooks, error, maxDepth, splices);
   if (encoder.encode(value, 0)) return true;
   out->resize(start);
+  if (splices != nullptr) splices->resize(splicesBefore);
   return false;
 }
 

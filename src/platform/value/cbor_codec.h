@@ -6,18 +6,31 @@
 #include <optional>
 #include <span>
 #include <string>
+#include <vector>
 
 #include "platform/value/value.h"
 #include "platform/value/value_codec.h"
 
 namespace typhora {
 
+// A kept encoding left out of an output buffer: its bytes belong before the byte at `at`.
+struct CborSplice {
+  std::size_t at = 0;
+  std::shared_ptr<const Bytes> bytes;
+};
+
 class CborCodec {
  public:
+  // Kept encodings of at least this many bytes are spliced rather than copied.
+  static constexpr std::size_t kSpliceBytes = 64 * 1024;
+
   // Appends the encoding of `value` to `out`. Fails (false, with `error` set when given) only for
-  // an endpoint that the hooks cannot place, or for nesting deeper than `maxDepth`.
+  // an endpoint that the hooks cannot place, or for nesting deeper than `maxDepth`. With
+  // `splices`, large kept encodings (the user-fonts records every enumerating client receives)
+  // are not copied into `out` but listed there, in order, for a writer that gathers its pieces.
   static bool encode(const Value& value, Bytes* out, const EndpointHooks* hooks = nullptr,
-                     std::string* error = nullptr, std::size_t maxDepth = 64);
+                     std::string* error = nullptr, std::size_t maxDepth = 64,
+                     std::vector<CborSplice>* splices = nullptr);
   static Bytes encode(const Value& value);  // no endpoints; never fails for other values
 
   // Decodes exactly one item filling all of `input`. nullopt on failure, with `error` telling

@@ -235,6 +235,47 @@ TEST(Codecs, AKeptEncodingIsTheWalkedOneAtAnyPlaceAndDepth) {
   EXPECT_EQ(CborCodec::encode(message(fonts, "a")), walked);
 }
 
+// A large kept encoding can be left out of the output and listed where it belongs: put back,
+// the pieces are the walked bytes, and a refused encoding leaves output and list as they were.
+TEST(Codecs, ASplicedEncodingPutBackIsTheWalkedOne) {
+  std::vector<DictionaryEntry> records;
+  for (int i = 0; i < 3000; ++i) {
+    records.emplace_back("/fonts/F" + std::to_string(i) + ".otf",
+                         Value::dictionary({{"familyName", "F"}, {"size", i}}));
+  }
+  const Value fonts = Value(Dictionary(std::move(records)));
+  const Value message = Value::array({1, Value::dictionary({{"a", fonts}, {"b", fonts}}), "end"});
+  const Bytes walked = CborCodec::encode(message);
+  auto& memo = CborEncodingMemo::shared();
+  memo.keep(fonts);
+  ASSERT_EQ(CborCodec::encode(message), walked);  // walked, then kept
+  Bytes out = {0xAA};
+  std::vector<CborSplice> splices;
+  ASSERT_TRUE(CborCodec::encode(message, &out, nullptr, nullptr, 64, &splices));
+  ASSERT_EQ(splices.size(), 2u);
+  Bytes whole = {0xAA};
+  std::size_t from = 1;
+  for (const CborSplice& splice : splices) {
+    whole.insert(whole.end(), out.begin() + static_cast<std::ptrdiff_t>(from),
+                 out.begin() + static_cast<std::ptrdiff_t>(splice.at));
+    whole.insert(whole.end(), splice.bytes->begin(), splice.bytes->end());
+    from = splice.at;
+  }
+  whole.insert(whole.end(), out.begin() + static_cast<std::ptrdiff_t>(from), out.end());
+  EXPECT_EQ(Bytes(whole.begin() + 1, whole.end()), walked);
+  EXPECT_LT(out.size(), 100u);
+
+  // Refused after a splice (nested past the limit): nothing of it stays in either.
+  const Bytes before = out;
+  const Value tooDeep = Value::array({fonts, Value::array({Value::array({1})})});
+  std::string error;
+  EXPECT_FALSE(CborCodec::encode(tooDeep, &out, nullptr, &error, 2, &splices));
+  EXPECT_THAT(error, HasSubstr("nesting"));
+  EXPECT_EQ(out, before);
+  EXPECT_EQ(splices.size(), 2u);
+  memo.forget(fonts);
+}
+
 TEST(Codecs, MalformedTruncatedAndOversizedInputsAreRefusedWithAReason) {
   Bytes good = CborCodec::encode(everything());
   std::string error;

@@ -4,6 +4,7 @@
 #include <sys/epoll.h>
 #include <sys/socket.h>
 
+#include <array>
 #include <cerrno>
 #include <cstring>
 
@@ -40,7 +41,7 @@ bool LumoConnection::send(const LumoMessage& message, std::string* error) {
     auto* lumo = dynamic_cast<const LumoEndpoint*>(endpoint.get());
     return lumo != nullptr ? fcntl(lumo->fd(), F_DUPFD_CLOEXEC, 0) : -1;
   };
-  const bool encoded = encodeLumoFrame(message, &out->bytes, &fds, fdOf, error);
+  const bool encoded = encodeLumoFrame(message, &out->bytes, &fds, fdOf, error, {}, &out->splices);
   for (int fd : fds) out->fds.emplace_back(fd);
   if (!encoded) return false;
   return sendFrame(std::move(out), error);
@@ -64,7 +65,7 @@ bool LumoConnection::sendFrame(std::unique_ptr<Outgoing> out, std::string* error
 }
 
 bool LumoConnection::enqueueLocked(std::unique_ptr<Outgoing> out, bool first, std::string* error) {
-  const std::size_t size = out->frame().size();
+  const std::size_t size = out->size();
   if (outboundBytes_ + size > kOutboundLimit) return false;
   // Many peers that do not read could each pile answers up to the connection's limit: past the
   // process's bound, one whose pile this answer would grow is cut off rather than given more. A
@@ -100,11 +101,11 @@ bool LumoConnection::flushLocked(std::string* error) {
   const bool held = outgoing_ && handshake_ != Handshake::Done;
   while (!outbound_.empty() && !held) {
     Outgoing& front = *outbound_.front();
-    const std::vector<std::uint8_t>& bytes = front.frame();
-    iovec iov{const_cast<std::uint8_t*>(bytes.data()) + front.offset, bytes.size() - front.offset};
+    const std::size_t size = front.size();
+    std::array<iovec, 16> iov;
     msghdr msg{};
-    msg.msg_iov = &iov;
-    msg.msg_iovlen = 1;
+    msg.msg_iov = iov.data();
+    msg.msg_iovlen = front.unsent(iov.data(), iov.size());
     std::vector<char> control;
     if (front.offset == 0) {
       std::vector<int> fds;
@@ -121,9 +122,9 @@ bool LumoConnection::flushLocked(std::string* error) {
     front.fds.clear();  // the descriptors went with the first byte
     front.offset += static_cast<std::size_t>(n);
     outboundSent_ += static_cast<std::size_t>(n);
-    if (front.offset == bytes.size()) {
-      outboundBytes_ -= bytes.size();
-      LumoAdmission::shared().addOutbound(-static_cast<std::ptrdiff_t>(bytes.size()));
+    if (front.offset == size) {
+      outboundBytes_ -= size;
+      LumoAdmission::shared().addOutbound(-static_cast<std::ptrdiff_t>(size));
       outbound_.pop_front();
     }
   }

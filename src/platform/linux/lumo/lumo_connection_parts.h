@@ -2,6 +2,9 @@
 // the helpers that both the reading and the lifecycle side use.
 #pragma once
 
+#include <sys/uio.h>
+
+#include <algorithm>
 #include <array>
 #include <condition_variable>
 #include <mutex>
@@ -29,10 +32,41 @@ struct LumoConnection::Pending {
 struct LumoConnection::Outgoing {
   std::vector<std::uint8_t> bytes;
   IpcSharedMessage::Encoding shared;  // instead of `bytes`: a frame other connections send too
-  std::vector<UniqueFd> fds;          // sent beside the first byte, then closed
-  std::size_t offset = 0;
+  // Kept encodings sent in place between pieces of `bytes`: an answer carrying the user-fonts
+  // records is not copied into a buffer of its own (megabytes, page by page) for each client.
+  std::vector<CborSplice> splices;
+  std::vector<UniqueFd> fds;  // sent beside the first byte, then closed
+  std::size_t offset = 0;     // bytes of the whole frame already sent
 
   const std::vector<std::uint8_t>& frame() const { return shared ? *shared : bytes; }
+
+  std::size_t size() const {
+    std::size_t size = frame().size();
+    for (const CborSplice& splice : splices) size += splice.bytes->size();
+    return size;
+  }
+
+  // The pieces of the frame still to send, from `offset` on: at most `max`, and how many.
+  std::size_t unsent(iovec* iov, std::size_t max) const {
+    const std::vector<std::uint8_t>& head = frame();
+    std::size_t count = 0;
+    std::size_t at = 0;  // where the next piece starts in the whole frame
+    auto add = [&](const std::uint8_t* data, std::size_t length) {
+      const std::size_t skip = offset > at ? std::min(offset - at, length) : 0;
+      if (length > skip && count < max) {
+        iov[count++] = {const_cast<std::uint8_t*>(data) + skip, length - skip};
+      }
+      at += length;
+    };
+    std::size_t from = 0;  // the next byte of `head` to send
+    for (const CborSplice& splice : splices) {
+      add(head.data() + from, splice.at - from);
+      add(splice.bytes->data(), splice.bytes->size());
+      from = splice.at;
+    }
+    add(head.data() + from, head.size() - from);
+    return count;
+  }
 };
 
 namespace lumo_detail {

@@ -17,6 +17,9 @@
 #include "platform/linux/identity/process_identity.h"
 #include "platform/linux/lumo/lumo_admission.h"
 #include "platform/linux/lumo/lumo_service.h"
+#include "platform/value/cbor_codec.h"
+#include "platform/value/cbor_encoding_memo.h"
+#include "platform/value/json_codec.h"
 #include "support/log_capture.h"
 #include "support/lumo_test_interface.h"
 #include "support/scoped_admission_limits.h"
@@ -45,7 +48,8 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
       const SerialQueue* queue = SerialQueue::current();
       if (queue == nullptr || queue->label() != "com.zorvane.lumo.connection") ++server_.offQueue;
       if (running_.exchange(true)) ++server_.overlaps;
-      if (op.wireName == "echo:reply:") reply({args[0]});
+      if (op.wireName == "echo:reply:")
+        reply({server_.keptAnswer.isNull() ? args[0] : server_.keptAnswer});
       if (op.wireName == "count:reply:") reply({Value(*args[0].asInt() + 1)});
       if (op.wireName == "hang:reply:") {
         server_.hung.signal();  // never answered
@@ -118,6 +122,7 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
   Semaphore release;
   std::atomic<int> offQueue{0};  // invocations that ran off their connection's queue
   std::atomic<int> overlaps{0};  // invocations begun while one of the same connection ran
+  Value keptAnswer;              // when set (before any call), what echo:reply: answers
 
  private:
   std::mutex mutex_;
@@ -291,6 +296,35 @@ TEST_F(LumoTest, BlockedHandlersLeaveOtherClientsServedAndAPeerGoneMidHandlerEnd
   EXPECT_TRUE(server_->invalidated.waitFor(20s));
   EXPECT_EQ(server_->invalidations.load(), 7);
   EXPECT_EQ(server_->overlaps.load(), 0);
+}
+
+// An answer holding a large kept encoding goes out in pieces, the kept bytes sent where they lie,
+// and is larger than the socket takes at once: every reader gets it whole, call after call.
+TEST_F(LumoTest, AnAnswerSentInPiecesArrivesWholeAtEveryReader) {
+  std::vector<DictionaryEntry> records;
+  for (int i = 0; i < 6000; ++i) {
+    records.emplace_back("/fonts/F" + std::to_string(i) + ".otf",
+                         Value::dictionary({{"familyName", "Family " + std::to_string(i)},
+                                            {"fileSize", 40'000 + i}}));
+  }
+  const Value fonts = Value(Dictionary(std::move(records)));
+  CborEncodingMemo::shared().keep(fonts);
+  ASSERT_GT(CborCodec::encode(fonts).size(), 4 * CborCodec::kSpliceBytes);  // now kept
+  server_->keptAnswer = Value::dictionary({{"fontsInfo", fonts}, {"extension", "token"}});
+  const std::string expected = JsonCodec::encode(Value::array({server_->keptAnswer})) + "\n";
+  std::vector<std::thread> readers;
+  std::atomic<int> whole{0};
+  for (int i = 0; i < 4; ++i) {
+    readers.emplace_back([&] {
+      for (int call = 0; call < 2; ++call) {
+        auto r = runCommand(peer({"call", "echo:reply:", "1"}), 30s);
+        whole += r.status == 0 && r.out == expected;
+      }
+    });
+  }
+  for (auto& t : readers) t.join();
+  CborEncodingMemo::shared().forget(fonts);
+  EXPECT_EQ(whole, 8);
 }
 
 TEST_F(LumoTest, APeerThatStopsReadingIsCutOffWhileOthersAreAnswered) {

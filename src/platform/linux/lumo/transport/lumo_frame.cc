@@ -34,7 +34,8 @@ std::optional<std::uint64_t> peekUnsigned(std::span<const std::uint8_t> bytes, s
 bool encodeLumoFrame(const LumoMessage& message, std::vector<std::uint8_t>* frame,
                      std::vector<int>* fds,
                      const std::function<int(const std::shared_ptr<const IpcEndpoint>&)>& fdOf,
-                     std::string* error, const LumoLimits& limits) {
+                     std::string* error, const LumoLimits& limits,
+                     std::vector<CborSplice>* splices) {
   EndpointHooks hooks;
   hooks.toIndex =
       [&](const std::shared_ptr<const IpcEndpoint>& ep) -> std::optional<std::uint64_t> {
@@ -46,8 +47,11 @@ bool encodeLumoFrame(const LumoMessage& message, std::vector<std::uint8_t>* fram
   Value payload = Value::array({Value(static_cast<std::int64_t>(message.kind)), Value(message.id),
                                 Value(message.text), Value(ValueArray(message.values))});
   frame->assign(kLumoHeaderSize, 0);
-  if (!CborCodec::encode(payload, frame, &hooks, error, limits.maxDepth)) return false;
-  const std::size_t length = frame->size() - kLumoHeaderSize;
+  if (!CborCodec::encode(payload, frame, &hooks, error, limits.maxDepth, splices)) return false;
+  std::size_t length = frame->size() - kLumoHeaderSize;
+  if (splices != nullptr) {
+    for (const CborSplice& splice : *splices) length += splice.bytes->size();
+  }
   if (length > limits.maxPayload) {
     if (error != nullptr) *error = "message larger than the size limit";
     return false;
@@ -63,7 +67,16 @@ void LumoFrameSplitter::addBytes(std::span<const std::uint8_t> bytes) {
     buffer_.clear();
     consumed_ = 0;
   }
+  const std::size_t frameStart = consumed_;
   buffer_.insert(buffer_.end(), bytes.begin(), bytes.end());
+  // The frame in front, once its length is known, gets its whole buffer at once.
+  if (buffer_.size() - frameStart >= kLumoHeaderSize &&
+      getU32(buffer_.data() + frameStart) == kLumoMagic) {
+    const std::uint32_t length = getU32(buffer_.data() + frameStart + 4);
+    if (length <= limits_.maxPayload && length <= limits_.wholeFrameBuffer) {
+      buffer_.reserve(frameStart + kLumoHeaderSize + length);
+    }
+  }
 }
 
 LumoFrameSplitter::Status LumoFrameSplitter::next(LumoRawFrame* frame, std::string* error) {
@@ -103,12 +116,13 @@ LumoFrameSplitter::Status LumoFrameSplitter::next(LumoRawFrame* frame, std::stri
   if (consumed_ == 0 && kLumoHeaderSize + length == buffer_.size()) {
     // The frame is all that is buffered, as a large message usually is once complete: the buffer
     // becomes the payload, without a second allocation of its size.
-    buffer_.erase(buffer_.begin(), buffer_.begin() + kLumoHeaderSize);
     frame->payload = std::move(buffer_);
+    frame->payloadStart = kLumoHeaderSize;
     buffer_.clear();
     return Status::Frame;
   }
   frame->payload.assign(payload.begin(), payload.end());
+  frame->payloadStart = 0;
   consumed_ += kLumoHeaderSize + length;
   if (consumed_ == buffer_.size()) {
     buffer_.clear();
@@ -139,8 +153,8 @@ std::optional<LumoMessage> decodeLumoFrame(
   // Large parts of the message stay encoded in the payload until read; endpoints are taken now.
   auto payload = std::make_shared<const Bytes>(std::move(frame.payload));
   std::string why;
-  std::optional<Value> decoded =
-      CborCodec::decodeLazily(payload, *payload, decodeLimits, &hooks, &why);
+  std::optional<Value> decoded = CborCodec::decodeLazily(
+      payload, std::span(*payload).subspan(frame.payloadStart), decodeLimits, &hooks, &why);
   if (!decoded) {
     *error = "undecodable message: " + why;
     return std::nullopt;

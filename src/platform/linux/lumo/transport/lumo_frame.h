@@ -16,6 +16,7 @@
 #include <vector>
 
 #include "platform/fd/unique_fd.h"
+#include "platform/value/cbor_codec.h"
 #include "platform/value/value.h"
 #include "platform/value/value_codec.h"
 
@@ -36,10 +37,13 @@ struct LumoLimits {
   std::uint32_t maxDescriptors = 16;  // per frame
   std::size_t maxDepth = 64;
   std::size_t maxItems = 4u << 20;  // array elements and dictionary entries of one message
+  // A frame up to this size gets its whole buffer once its header is in, not one grown and
+  // copied chunk by chunk: a service's answers are taken at their word, a client's calls not.
+  std::uint32_t wholeFrameBuffer = 64u << 20;
 
   // What a service accepts from its clients: they send small calls (large answers go out, not
   // in), so a hostile frame costs little memory and decoding time.
-  static LumoLimits inboundFromClients() { return {1u << 20, 16, 32, 1u << 16}; }
+  static LumoLimits inboundFromClients() { return {1u << 20, 16, 32, 1u << 16, 64u << 10}; }
 };
 
 inline constexpr std::uint32_t kLumoMagic = 0x4F4D554C;  // "LUMO"
@@ -49,7 +53,10 @@ inline constexpr std::size_t kLumoHeaderSize = 12;
 struct LumoRawFrame {
   LumoMessage::Kind kind = LumoMessage::Kind::Invoke;
   std::uint64_t id = 0;
+  // The payload from `payloadStart` on: a large frame keeps its header in front, where it was
+  // read, rather than move megabytes down by twelve bytes.
   std::vector<std::uint8_t> payload;
+  std::size_t payloadStart = 0;
   std::vector<UniqueFd> descriptors;
 };
 
@@ -81,10 +88,13 @@ std::optional<LumoMessage> decodeLumoFrame(
     std::string* error);
 
 // Encodes a message into a frame; endpoints become descriptor indexes appended to `fds`
-// (duplicated by `fdOf`). False with `error` when the message cannot be encoded.
+// (duplicated by `fdOf`). False with `error` when the message cannot be encoded. With
+// `splices`, large kept encodings stay out of `frame` and are listed there, to be sent in place
+// (the header's length counts them).
 bool encodeLumoFrame(const LumoMessage& message, std::vector<std::uint8_t>* frame,
                      std::vector<int>* fds,
                      const std::function<int(const std::shared_ptr<const IpcEndpoint>&)>& fdOf,
-                     std::string* error, const LumoLimits& limits = {});
+                     std::string* error, const LumoLimits& limits = {},
+                     std::vector<CborSplice>* splices = nullptr);
 
 }  // namespace typhora
