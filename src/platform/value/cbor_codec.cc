@@ -47,14 +47,24 @@ std::shared_ptr<const Bytes> keptEncoding(const void* container, std::size_t ite
 std::size_t sizeBound(const Value& value, std::size_t depth, bool splicing) {
   if (depth > 256) return 0;  // the encoder refuses such depths anyway
   if (const LazyContainer* lazy = value.lazyContainer()) return lazy->encoding().size();
-  auto keptSize = [splicing](const std::shared_ptr<const Bytes>& kept) {
-    return splicing && kept->size() >= CborCodec::kSpliceBytes ? 0 : kept->size();
+  // A kept container takes its kept size, or none when it will be spliced (or first encoded
+  // apart, to be spliced).
+  auto keptSize = [splicing](const void* container,
+                             std::size_t items) -> std::optional<std::size_t> {
+    CborEncodingMemo::Encoding known;
+    bool kept = false;
+    const std::shared_ptr<const Bytes> bytes = keptEncoding(container, items, &known, &kept);
+    if (splicing && kept && (!bytes || bytes->size() >= CborCodec::kSpliceBytes)) return 0;
+    if (bytes) return bytes->size();
+    return std::nullopt;
   };
+  std::optional<std::size_t> kept;
   if (const Dictionary* dictionary = value.asDictionary()) {
-    if (auto kept = keptEncoding(dictionary, dictionary->size())) return keptSize(kept);
+    kept = keptSize(dictionary, dictionary->size());
   } else if (const ValueArray* array = value.asArray()) {
-    if (auto kept = keptEncoding(array, array->size())) return keptSize(kept);
+    kept = keptSize(array, array->size());
   }
+  if (kept) return *kept;
   switch (value.type()) {
     case Value::Type::String:
       return 9 + value.asString()->size();
@@ -111,7 +121,7 @@ class Encoder {
         return head(kTag, kDateTag) && real(value.asDate()->secondsSince1970);
       case Value::Type::Array: {
         const ValueArray& array = *value.asArray();
-        return shared(&array, array.size(), depth, [&] {
+        return shared(value, &array, array.size(), depth, [&] {
           if (!head(kArray, array.size())) return false;
           for (const Value& item : array) {
             if (!encode(item, depth + 1)) return false;
@@ -121,7 +131,7 @@ class Encoder {
       }
       case Value::Type::Dictionary: {
         const Dictionary& dict = *value.asDictionary();
-        return shared(&dict, dict.size(), depth, [&] {
+        return shared(value, &dict, dict.size(), depth, [&] {
           if (!head(kMap, dict.size())) return false;
           for (const auto& [key, item] : dict) {
             if (!bytes(kText, key) || !encode(item, depth + 1)) return false;
@@ -146,11 +156,13 @@ class Encoder {
     return true;
   }
 
-  // An array or dictionary kept by the memo is copied from its kept encoding, and encoded (then
-  // kept) by `walk` the first time. An encoding that placed endpoints is not kept: their indexes
-  // belong to one message.
+  // An array or dictionary kept by the memo is copied (or spliced) from its kept encoding, and
+  // encoded (then kept) by `walk` the first time. An encoding that placed endpoints is not kept:
+  // their indexes belong to one message.
   template <class Walk>
-  bool shared(const void* container, std::size_t items, std::size_t depth, const Walk& walk) {
+  bool shared(const Value& value, const void* container, std::size_t items, std::size_t depth,
+              const Walk& walk) {
+    if (container == apart_) return walk();
     CborEncodingMemo::Encoding known;
     bool kept = false;
     if (auto bytes = keptEncoding(container, items, &known, &kept)) {
@@ -165,6 +177,7 @@ class Encoder {
       return true;
     }
     if (!kept) return walk();
+    if (splices_ != nullptr) return encodeApart(value, container, depth);
     const std::size_t start = out_.size();
     const std::size_t endpointsBefore = endpoints_;
     const std::size_t deepestBefore = deepest_;
@@ -179,6 +192,30 @@ class Encoder {
                       height});
     }
     return ok;
+  }
+
+  // A kept container met unencoded while splicing: encoded into a buffer of its own, which the
+  // memo keeps and the output splices, neither copying it.
+  bool encodeApart(const Value& value, const void* container, std::size_t depth) {
+    auto own = std::make_shared<Bytes>();
+    own->reserve(sizeBound(value, depth, false));
+    Encoder apart(own.get(), hooks_, error_, maxDepth_, nullptr);
+    apart.apart_ = container;
+    apart.deepest_ = depth;
+    apart.endpoints_ = endpoints_;  // indexes go on from this message's
+    if (!apart.encode(value, depth)) return false;
+    const std::size_t height = apart.deepest_ - depth;
+    deepest_ = std::max(deepest_, apart.deepest_);
+    const bool placedEndpoints = apart.endpoints_ != endpoints_;
+    endpoints_ = apart.endpoints_;
+    if (!placedEndpoints) CborEncodingMemo::shared().store(container, {own, height});
+    if (own->size() >= CborCodec::kSpliceBytes) {
+      splices_->push_back({out_.size(), std::move(own)});
+      return true;
+    }
+    ensure(own->size());
+    out_.insert(out_.end(), own->begin(), own->end());
+    return true;
   }
 
   // Grows the buffer geometrically ahead of writes: resizing a byte vector a few bytes at a time
@@ -257,8 +294,9 @@ class Encoder {
   std::string* error_;
   std::size_t maxDepth_;
   std::vector<CborSplice>* splices_;
-  std::size_t deepest_ = 0;    // the deepest level encoded so far
-  std::size_t endpoints_ = 0;  // endpoints met so far
+  const void* apart_ = nullptr;  // the container this encoder encodes apart: walked, not kept
+  std::size_t deepest_ = 0;      // the deepest level encoded so far
+  std::size_t endpoints_ = 0;    // endpoints met so far
 };
 
 }  // namespace

@@ -69,16 +69,8 @@ void Value::setUnsigned(std::uint64_t u) {
   }
 }
 
-Value::Type Value::type() const {
-  if (const LazyContainer* lazy = lazyContainer()) {
-    return lazy->isDictionary() ? Type::Dictionary : Type::Array;
-  }
-  return static_cast<Type>(v_.index());
-}
-
-const LazyContainer* Value::lazyContainer() const {
-  auto* p = std::get_if<std::shared_ptr<const LazyContainer>>(&v_);
-  return p ? p->get() : nullptr;
+Value::Type Value::lazyType() const {
+  return lazyContainer()->isDictionary() ? Type::Dictionary : Type::Array;
 }
 
 bool Value::isNumber() const {

@@ -95,7 +95,11 @@ class Value {
     return Value(Bytes(bytes.begin(), bytes.end()));
   }
 
-  Type type() const;
+  Type type() const {
+    // Every index but the last is its type; the last is a container still encoded.
+    return v_.index() + 1 == std::variant_size_v<decltype(v_)> ? lazyType()
+                                                               : static_cast<Type>(v_.index());
+  }
   bool isNull() const { return type() == Type::Null; }
   bool isNumber() const;  // Int, UInt or Double
 
@@ -113,7 +117,10 @@ class Value {
   const Dictionary* asDictionary() const;
   const std::shared_ptr<const IpcEndpoint>* asEndpoint() const;
   // The container when it is still encoded (opened or not), for the encoder to copy.
-  const LazyContainer* lazyContainer() const;
+  const LazyContainer* lazyContainer() const {
+    auto* p = std::get_if<std::shared_ptr<const LazyContainer>>(&v_);
+    return p ? p->get() : nullptr;
+  }
 
   // Dictionary lookup: the value under `key`, or a null Value when this is not a dictionary or
   // the key is missing. Chains: info.get("familyName").get("Foo-Bold").asString().
@@ -134,6 +141,7 @@ class Value {
 
  private:
   void setUnsigned(std::uint64_t u);
+  Type lazyType() const;  // Array or Dictionary
 
   std::variant<std::monostate, bool, std::int64_t, std::uint64_t, double, std::string,
                std::shared_ptr<const Bytes>, Date, std::shared_ptr<const ValueArray>,
