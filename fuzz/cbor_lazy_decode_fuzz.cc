@@ -4,6 +4,7 @@
 #include <cstdint>
 #include <cstdlib>
 #include <memory>
+#include <vector>
 
 #include "platform/ipc/ipc_endpoint.h"
 #include "platform/value/cbor_codec.h"
@@ -59,6 +60,18 @@ extern "C" int LLVMFuzzerTestOneInput(const std::uint8_t* data, std::size_t size
     require(fastError == referenceError && lazyError == referenceError);
     return 0;
   }
+  // A field read alone from a dictionary still encoded is the field built, at the top and one
+  // level down, before anything opens them.
+  for (const auto& [key, item] : reference->asDictionary() != nullptr
+                                     ? reference->asDictionary()->entries()
+                                     : std::vector<typhora::DictionaryEntry>{}) {
+    const typhora::Value field = lazy->peek(key);
+    if (const typhora::Dictionary* inner = item.asDictionary()) {
+      for (const auto& [innerKey, innerItem] : *inner) require(field.peek(innerKey) == innerItem);
+    }
+    require(field == item);
+  }
+  require(lazy->peek("\xff not a key").isNull());
   // Encoding first copies what the lazy value still holds encoded; comparing opens all of it.
   auto encode = [hooks](const typhora::Value& value) {
     typhora::Bytes out;

@@ -20,7 +20,7 @@ Value tokenValue(const std::string& token) {
 }
 
 bool isDisabled(const Value& record) {
-  return record.get("disabled").asBool() == true;
+  return record.peek("disabled").asBool() == true;
 }
 
 Value copyForClient(const Value& record, const Value& token) {

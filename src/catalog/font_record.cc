@@ -5,7 +5,7 @@
 namespace typhora {
 
 bool FontRecord::isDisabled(const Value& record) {
-  return record.get("disabled").asBool() == true;
+  return record.peek("disabled").asBool() == true;
 }
 
 std::vector<std::string> FontRecord::familyNames(const Value& record) {

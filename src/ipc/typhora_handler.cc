@@ -86,7 +86,7 @@ void TyphoraHandler::checkinForFontPicker(const IpcReply& reply) {
     }
     Value fonts = server_->filterUserFontInfoForAuditToken(
         token, true, [](const std::string&, const Value& record, bool*) {
-          return record.get("disabled").asBool() != true;
+          return record.peek("disabled").asBool() != true;
         });
     std::vector<DictionaryEntry> checkin{{"fontsInfo", std::move(fonts)}};
     if (Value extension = server_->sandboxExtensionForEnumeration(token); !extension.isNull())

@@ -78,6 +78,52 @@ Dictionary CborReader::readDictionary(const std::shared_ptr<const Source>& sourc
   return Dictionary(reader.entries());
 }
 
+Value CborReader::readValueAt(const std::shared_ptr<const Source>& source, std::size_t index,
+                              std::string_view key) {
+  CborReader reader(source->bytes, &source, nullptr);
+  reader.seek(index);
+  const std::uint64_t count = reader.argument();
+  for (std::uint64_t i = 0; i < count; ++i) {
+    const std::uint64_t size = reader.argument();  // a key: text, as the scanner made sure
+    const std::string_view name(reinterpret_cast<const char*>(reader.at_), size);
+    reader.at_ += size;
+    if (name == key) return reader.item();
+    if (name > key) break;  // keys stand in increasing byte order
+    reader.skip();
+  }
+  return Value();
+}
+
+// Steps over the item at the cursor, building nothing. Containers left encoded further on are
+// still found by lazyAt, which catches up with the cursor.
+void CborReader::skip() {
+  const std::uint8_t initial = *at_;
+  switch (initial >> 5) {
+    case 0:
+    case 1:
+      argument();
+      return;
+    case 2:
+    case 3:
+      at_ += argument();
+      return;
+    case 4:
+    case 5: {
+      const std::uint64_t items = argument() * ((initial >> 5) == 5 ? 2 : 1);
+      for (std::uint64_t i = 0; i < items; ++i) skip();
+      return;
+    }
+    case 6:
+      argument();
+      skip();
+      return;
+    default:
+      ++at_;
+      at_ += initial == 0xf9 ? 2 : initial == 0xfa ? 4 : initial == 0xfb ? 8 : 0;
+      return;
+  }
+}
+
 std::uint64_t CborReader::argument() {
   const std::uint8_t info = *at_++ & 0x1f;
   if (info < 24) return info;

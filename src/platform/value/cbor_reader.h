@@ -9,6 +9,7 @@
 #include <memory>
 #include <optional>
 #include <span>
+#include <string_view>
 #include <vector>
 
 #include "platform/value/cbor_scanner.h"
@@ -34,6 +35,10 @@ class CborReader {
   // The items of `source->lazy[index]`, an array or a dictionary.
   static ValueArray readArray(const std::shared_ptr<const Source>& source, std::size_t index);
   static Dictionary readDictionary(const std::shared_ptr<const Source>& source, std::size_t index);
+  // The value under `key` in `source->lazy[index]`, a dictionary, read without the rest of it;
+  // a null Value when it has no such key.
+  static Value readValueAt(const std::shared_ptr<const Source>& source, std::size_t index,
+                           std::string_view key);
 
  private:
   CborReader(std::span<const std::uint8_t> bytes, const std::shared_ptr<const Source>* source,
@@ -49,6 +54,7 @@ class CborReader {
   double number();
   Value simple();
   void seek(std::size_t index);
+  void skip();
 
   const std::uint8_t* base_;
   const std::uint8_t* at_;

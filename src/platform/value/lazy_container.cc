@@ -25,6 +25,15 @@ const ValueArray* LazyContainer::array() const {
   return &array_;
 }
 
+Value LazyContainer::valueAt(std::string_view key) const {
+  if (!isDictionary()) return Value();
+  if (opened_.load(std::memory_order_acquire)) {
+    const Value* found = dictionary_.find(key);
+    return found != nullptr ? *found : Value();
+  }
+  return CborReader::readValueAt(source_, index_, key);
+}
+
 const Dictionary* LazyContainer::dictionary() const {
   if (!isDictionary()) return nullptr;
   open();

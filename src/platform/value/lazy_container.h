@@ -8,6 +8,7 @@
 #include <memory>
 #include <mutex>
 #include <span>
+#include <string_view>
 
 #include "platform/value/cbor_reader.h"
 #include "platform/value/value.h"
@@ -26,6 +27,9 @@ class LazyContainer {
 
   const ValueArray* array() const;       // nullptr for a dictionary
   const Dictionary* dictionary() const;  // nullptr for an array
+  // The value under `key` of a dictionary, read alone while the container is still unopened: a
+  // caller after one field of thousands of records need not build them all.
+  Value valueAt(std::string_view key) const;
 
  private:
   const CborScanner::Container& container() const { return source_->lazy[index_]; }

@@ -3,6 +3,7 @@
 #include <sys/mman.h>
 
 #include <memory>
+#include <utility>
 
 #include "platform/fd/regular_file.h"
 #include "platform/value/cbor_codec.h"
@@ -55,6 +56,8 @@ class FileBytes {
   ~FileBytes() {
     if (data_ != nullptr) munmap(data_, size_);
   }
+  FileBytes(FileBytes&& other) noexcept
+      : data_(std::exchange(other.data_, nullptr)), size_(std::exchange(other.size_, 0)) {}
   FileBytes(const FileBytes&) = delete;
   FileBytes& operator=(const FileBytes&) = delete;
 
@@ -65,6 +68,10 @@ class FileBytes {
   std::uint8_t* data_ = nullptr;
   std::size_t size_ = 0;
 };
+
+// Files from this size on keep their containers of kEncodedRecordBytes or more encoded.
+constexpr std::size_t kEncodedRecordsFileBytes = 256 * 1024;
+constexpr std::size_t kEncodedRecordBytes = 64;
 
 }  // namespace
 
@@ -83,9 +90,18 @@ std::optional<Value> PlistReader::readFile(const std::string& path, const Decode
   if (!RegularFile::readInto(fd.get(), buffer.span(), &done, error)) return std::nullopt;
   const std::span<const std::uint8_t> bytes = buffer.span().first(done);
   std::string why;
-  // Decoded whole: a file's value is usually kept (the daemon's caches) and walked in full, and a
-  // part left encoded would keep the whole file's buffer with it.
-  auto value = read(bytes, limits, &why);
+  std::optional<Value> value;
+  if (bytes.size() >= kEncodedRecordsFileBytes && detect(bytes) == Format::Cbor) {
+    // A large file is a catalog of records (the user-fonts information): they stay encoded in
+    // the file's buffer, smaller than built, until read, and are copied as they stand into the
+    // answers that carry them. One field of each (a record's disabled state) is read alone.
+    auto owner = std::make_shared<const FileBytes>(std::move(buffer));
+    value = CborCodec::decodeLazily(owner, bytes, limits, nullptr, &why, kEncodedRecordBytes);
+  } else {
+    // Decoded whole: a small file's value is walked in full, and a part left encoded would keep
+    // the file's buffer with it.
+    value = read(bytes, limits, &why);
+  }
   if (!value) return failWith("cannot decode: " + why);
   return value;
 }

@@ -24,7 +24,8 @@ class PlistReader {
   // arrays and dictionaries hold.
   static bool decodes(std::span<const std::uint8_t> bytes, const DecodeLimits& limits = {},
                       std::string* error = nullptr);
-  // nullopt when the file cannot be opened or read, or does not decode; `error` says which.
+  // nullopt when the file cannot be opened or read, or does not decode; `error` says which. A
+  // large CBOR file (a catalog) keeps its records encoded in the file's buffer until read.
   static std::optional<Value> readFile(const std::string& path, const DecodeLimits& limits = {},
                                        std::string* error = nullptr);
 };

@@ -142,6 +142,11 @@ const Value& Value::get(std::string_view key) const {
   return found ? *found : nullValue();
 }
 
+Value Value::peek(std::string_view key) const {
+  if (const LazyContainer* lazy = lazyContainer()) return lazy->valueAt(key);
+  return get(key);
+}
+
 const Value& Value::at(std::size_t index) const {
   const ValueArray* array = asArray();
   return array && index < array->size() ? (*array)[index] : nullValue();

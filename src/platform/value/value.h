@@ -125,6 +125,8 @@ class Value {
   // Dictionary lookup: the value under `key`, or a null Value when this is not a dictionary or
   // the key is missing. Chains: info.get("familyName").get("Foo-Bold").asString().
   const Value& get(std::string_view key) const;
+  // As get(), by value: a dictionary still encoded is read no further than `key`, and stays so.
+  Value peek(std::string_view key) const;
   // Array element, or a null Value when out of range or not an array.
   const Value& at(std::size_t index) const;
 

@@ -352,6 +352,48 @@ TEST(CborLazyDecoding, FuzzCorporaDecodeAlike) {
 
 // A file's value is kept and walked whole by its readers: a part left encoded would keep the whole
 // file's buffer in memory for as long.
+// A large catalog file keeps its records encoded. One field read alone from a record still
+// encoded is the field of the record built, for keys before, among and after its own, missing or
+// not, past a nested container left encoded too; and so it stays once the record is opened.
+TEST(CborLazyDecoding, ALargeFileKeepsItsRecordsEncodedAndAFieldIsReadAlone) {
+  std::vector<DictionaryEntry> entries = records(2000).asDictionary()->entries();
+  std::vector<DictionaryEntry> nested;
+  for (int i = 0; i < 20; ++i) nested.emplace_back("name" + std::to_string(i), "Family");
+  for (std::size_t i = 0; i < entries.size(); i += 7) {
+    entries[i].second = entries[i].second.with("aaNested", Value(Dictionary(nested)));
+  }
+  const Value catalog = Value(Dictionary(std::move(entries)));
+  const Bytes bytes = CborCodec::encode(catalog);
+  ASSERT_GE(bytes.size(), 256u * 1024);
+  auto writeFile = [](const std::string& path, std::span<const std::uint8_t> content) {
+    std::ofstream(path, std::ios::binary)
+        .write(reinterpret_cast<const char*>(content.data()),
+               static_cast<std::streamsize>(content.size()));
+  };
+  const std::string path = ::testing::TempDir() + "/typhora-catalog.cbor";
+  writeFile(path, bytes);
+  std::string error;
+  const std::optional<Value> read = PlistReader::readFile(path, {}, &error);
+  ASSERT_TRUE(read) << error;
+  const char* keys[] = {"",         "aaNested",  "b",          "delta",    "digest",
+                        "disabled", "disabledX", "familyName", "fileSize", "installDate",
+                        "scale",    "tags",      "zzz"};
+  for (int pass = 0; pass < 2; ++pass) {
+    int encoded = 0;
+    for (const auto& [key, record] : *read->asDictionary()) {
+      encoded += record.lazyContainer() != nullptr;
+      const Value& built = catalog.get(key);
+      for (const char* field : keys) {
+        ASSERT_EQ(record.peek(field), built.get(field)) << key << " " << field << " " << pass;
+      }
+    }
+    EXPECT_EQ(encoded, 2000);
+    EXPECT_EQ(*read, catalog);  // opens every record for the second pass
+  }
+  std::filesystem::remove(path);
+}
+
+// A file below a catalog's size is built whole.
 TEST(CborLazyDecoding, PlistFilesAreDecodedWhole) {
   const std::string path = ::testing::TempDir() + "/typhora-lazy.plist";
   const Value fonts = records(100);
