@@ -48,8 +48,10 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
       const SerialQueue* queue = SerialQueue::current();
       if (queue == nullptr || queue->label() != "com.zorvane.lumo.connection") ++server_.offQueue;
       if (running_.exchange(true)) ++server_.overlaps;
-      if (op.wireName == "echo:reply:")
-        reply({server_.keptAnswer.isNull() ? args[0] : server_.keptAnswer});
+      if (op.wireName == "echo:reply:") {
+        const Value kept = server_.keptAnswer();
+        reply({kept.isNull() ? args[0] : kept});
+      }
       if (op.wireName == "count:reply:") reply({Value(*args[0].asInt() + 1)});
       if (op.wireName == "hang:reply:") {
         server_.hung.signal();  // never answered
@@ -102,6 +104,16 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
     return lastCaller_;
   }
 
+  // When set, what echo:reply: answers instead of its argument.
+  void setKeptAnswer(Value answer) {
+    std::lock_guard lock(mutex_);
+    keptAnswer_ = std::move(answer);
+  }
+  Value keptAnswer() {
+    std::lock_guard lock(mutex_);
+    return keptAnswer_;
+  }
+
   void note(pid_t from, const std::string& text) {
     std::lock_guard lock(mutex_);
     notes_[from].push_back(text);
@@ -122,12 +134,12 @@ class Server final : public IpcListenerDelegate, public std::enable_shared_from_
   Semaphore release;
   std::atomic<int> offQueue{0};  // invocations that ran off their connection's queue
   std::atomic<int> overlaps{0};  // invocations begun while one of the same connection ran
-  Value keptAnswer;              // when set (before any call), what echo:reply: answers
 
  private:
   std::mutex mutex_;
   std::map<pid_t, std::vector<std::string>> notes_;
   AuditToken lastCaller_;
+  Value keptAnswer_;
   std::vector<std::shared_ptr<IpcConnection>> accepted_;
 };
 
@@ -310,8 +322,9 @@ TEST_F(LumoTest, AnAnswerSentInPiecesArrivesWholeAtEveryReader) {
   const Value fonts = Value(Dictionary(std::move(records)));
   CborEncodingMemo::shared().keep(fonts);
   ASSERT_GT(CborCodec::encode(fonts).size(), 4 * CborCodec::kSpliceBytes);  // now kept
-  server_->keptAnswer = Value::dictionary({{"fontsInfo", fonts}, {"extension", "token"}});
-  const std::string expected = JsonCodec::encode(Value::array({server_->keptAnswer})) + "\n";
+  const Value answer = Value::dictionary({{"fontsInfo", fonts}, {"extension", "token"}});
+  server_->setKeptAnswer(answer);
+  const std::string expected = JsonCodec::encode(Value::array({answer})) + "\n";
   std::vector<std::thread> readers;
   std::atomic<int> whole{0};
   for (int i = 0; i < 4; ++i) {
