@@ -182,6 +182,9 @@ TEST_F(HostilePeerTest, NoFrameCountsUnlessThePinnedPeerWroteItAfterTheHello) {
 
 TEST_F(HostilePeerTest, DescriptorsAndMemoryStayBoundedAndComeBackAfterTheAttack) {
   startDaemon();
+  // The count to come back to is the started daemon's: its event socket opens after the service
+  // socket, and a count taken in between reads low.
+  ASSERT_TRUE(daemon_->waitForLine("typhorad ready", 30s)) << daemon_->output();
   freshCall();
   const pid_t pid = daemon_->pid();
   const long fdsBefore = descriptorCount(pid);
