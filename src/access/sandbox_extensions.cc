@@ -1,5 +1,6 @@
 // What a caller receives of the user-fonts information, and the sandbox extension tokens that
 // open it: directory-wide for enumeration and providers, one per file for issued fonts.
+#include "catalog/font_record.h"
 #include "daemon/paths.h"
 #include "daemon/typhora_daemon.h"
 #include "platform/log/log.h"
@@ -17,10 +18,6 @@ Value tokenValue(const std::string& token) {
   Bytes bytes(token.begin(), token.end());
   bytes.push_back(0);
   return Value(std::move(bytes));
-}
-
-bool isDisabled(const Value& record) {
-  return record.peek("disabled").asBool() == true;
 }
 
 Value copyForClient(const Value& record, const Value& token) {
@@ -116,7 +113,7 @@ Value TyphoraDaemon::fontInfoForAuditToken(
       token, withEnumuration,
       [&](const std::string& path, const Value& record, bool* covered) {
         if (andFileFilters && !andFileFilters->contains(path)) return false;
-        if (isDisabled(record)) return false;
+        if (FontRecord::isDisabled(record)) return false;
         if (withEnumuration) return true;
         if (!installation) return false;
         if (!directory || containingDirectoryName(path) != *directory) return false;

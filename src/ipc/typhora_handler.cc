@@ -2,6 +2,7 @@
 
 #include <string_view>
 
+#include "catalog/font_record.h"
 #include "daemon/typhora_daemon.h"
 #include "ipc/interface_descriptions.h"
 #include "platform/log/log.h"
@@ -86,7 +87,7 @@ void TyphoraHandler::checkinForFontPicker(const IpcReply& reply) {
     }
     Value fonts = server_->filterUserFontInfoForAuditToken(
         token, true, [](const std::string&, const Value& record, bool*) {
-          return record.peek("disabled").asBool() != true;
+          return !FontRecord::isDisabled(record);
         });
     std::vector<DictionaryEntry> checkin{{"fontsInfo", std::move(fonts)}};
     if (Value extension = server_->sandboxExtensionForEnumeration(token); !extension.isNull())
